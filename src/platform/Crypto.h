@@ -1,0 +1,49 @@
+// Digests, HMAC, RSA signature verification and base64, over OpenSSL.
+// All functions are pure and thread-safe.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <string_view>
+
+#include "platform/Result.h"
+#include "telvane/Value.h"
+
+namespace telvane::crypto {
+
+Bytes sha1(const std::uint8_t* data, std::size_t size);
+Bytes sha256(const std::uint8_t* data, std::size_t size);
+inline Bytes sha1(std::string_view s) { return sha1(reinterpret_cast<const std::uint8_t*>(s.data()), s.size()); }
+inline Bytes sha256(std::string_view s) { return sha256(reinterpret_cast<const std::uint8_t*>(s.data()), s.size()); }
+Bytes hmacSha1(const Bytes& key, const std::uint8_t* data, std::size_t size);
+inline Bytes hmacSha1(const Bytes& key, std::string_view s) {
+  return hmacSha1(key, reinterpret_cast<const std::uint8_t*>(s.data()), s.size());
+}
+
+// Lower-case hexadecimal text of the bytes.
+std::string hex(const Bytes& bytes);
+
+// An RSA public key read from DER: SubjectPublicKeyInfo or PKCS#1 RSAPublicKey.
+class PublicKey {
+ public:
+  static Result<PublicKey> fromDer(const Bytes& der);
+  PublicKey(PublicKey&&) noexcept;
+  PublicKey& operator=(PublicKey&&) noexcept;
+  ~PublicKey();
+
+  // Verifies an RSA PKCS#1 v1.5 signature over the SHA-1 digest of the data.
+  Status verifySha1(const std::uint8_t* data, std::size_t size, const Bytes& signature) const;
+
+ private:
+  explicit PublicKey(void* key) : key_(key) {}
+  void* key_ = nullptr;  // EVP_PKEY*
+};
+
+std::string base64Encode(const std::uint8_t* data, std::size_t size);
+inline std::string base64Encode(const Bytes& b) { return base64Encode(b.data(), b.size()); }
+// Decodes base64, ignoring every character outside the alphabet (line breaks, blanks,
+// junk). Fails only when the remaining characters cannot form base64 (a dangling
+// single character).
+Result<Bytes> base64Decode(std::string_view text);
+
+}  // namespace telvane::crypto
