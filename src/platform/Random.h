@@ -27,7 +27,7 @@ class Random {
   static std::shared_ptr<Random> system();
 };
 
-// The canonical upper-case text of 16 UUID bytes.
+// The canonical upper-case text of 16 UUID bytes; empty for any other length.
 std::string uuidText(const Bytes& bytes);
 
 }  // namespace telvane

@@ -1,7 +1,8 @@
 // SettingsStore: persistent typed settings in named domains ("user defaults").
 //
-// Values are strings, integers, doubles, booleans (and, for system use, any Value,
-// stored in its binary property-list form). An absent key reads as nullopt, which is
+// Values are strings, integers, doubles, booleans (and, for system use, any Value:
+// bytes, dates and unsigned integers keep their type; arrays and dictionaries are
+// stored in their MessagePack form). An absent key reads as nullopt, which is
 // told apart from every present value. Writes are transactional and visible to other
 // processes using the same database. Implementations are thread-safe.
 #pragma once
