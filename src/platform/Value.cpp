@@ -86,11 +86,17 @@ void describe(const Value& v, std::string& out) {
     }
     case Value::Type::Date: {
       double t = v.asDate()->secondsSince1970;
-      std::time_t secs = static_cast<std::time_t>(std::floor(t));
+      // Beyond the calendar's range (or not a number) the seconds are printed as they
+      // are; converting such a double to time_t would be undefined.
+      bool inRange = t > -1e17 && t < 1e17;
+      std::time_t secs = inRange ? static_cast<std::time_t>(std::floor(t)) : 0;
       std::tm tm{};
-      gmtime_r(&secs, &tm);
       char buf[40];
-      std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S +0000", &tm);
+      if (inRange && gmtime_r(&secs, &tm)) {
+        std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S +0000", &tm);
+      } else {
+        std::snprintf(buf, sizeof buf, "%.17g", t);
+      }
       out += buf;
       break;
     }
