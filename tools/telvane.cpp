@@ -1,0 +1,270 @@
+// telvane: the command-line client of telvaned, for scripts and for people trying the
+// system.
+//
+//   telvane send    --component-type N [session options] --category C --type T [--payload JSON] [--flag F] [--count K]
+//   telvane oneshot --component-type N [session options] --category C --type T [--payload JSON] [--count K]
+//   telvane states  --component-type N [session options]
+//   telvane upload  --component-type N [session options] FILE
+//
+// `send`, `states` and `upload` open one reporting session, start it, do their work,
+// finish the session and print what the daemon said, one fact per line:
+//   start: configured | start: not configured
+//   enabled backends: a, b | none
+//   whitelist: 1, 2 | none
+//   blacklist: none
+//   events: 3 sent, 0 filtered              (send)
+//   flush: ok | flush: failed: TEXT (DOMAIN, code N)   (send)
+//   file upload supported: yes | no         (upload)
+//   upload: succeeded | upload: failed      (upload)
+//   reply: TEXT                             (every reply text of the daemon, in order)
+//   session: finished
+// `oneshot` prints `reply: TEXT` (or `reply: none`) per event.
+//
+// Errors go to standard error as "telvane: ..."; exit status 0 on success, 1 when the
+// daemon refused or did not answer in time, 2 for a malformed command line. The
+// library's own log lines appear on standard error only with --verbose.
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cstdio>
+#include <future>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "TelvaneToolOptions.h"
+#include "platform/Log.h"
+#include "platform/Paths.h"
+#include "telvane/Telvane.h"
+#include "telvane/TelvaneKeys.h"
+
+namespace {
+
+using telvane::Error;
+using telvane::Telvane;
+using telvane::Value;
+using telvane::tool::Command;
+using telvane::tool::ToolOptions;
+
+constexpr int kExitOk = 0;
+constexpr int kExitFailure = 1;
+constexpr int kExitUsage = 2;
+// Between two attempts to reach a daemon that is not there yet.
+constexpr std::chrono::milliseconds kConnectRetryMs{100};
+
+int fail(const std::string& message) {
+  std::fprintf(stderr, "telvane: %s\n", message.c_str());
+  return kExitFailure;
+}
+
+std::string errorText(const Error& error) {
+  return error.description + " (" + error.domain + ", code " + std::to_string(error.code) + ")";
+}
+
+template <typename T>
+std::string joined(const std::vector<T>& items) {
+  if (items.empty()) return "none";
+  std::string out;
+  for (const auto& item : items) {
+    if (!out.empty()) out += ", ";
+    if constexpr (std::is_same_v<T, std::string>) {
+      out += item;
+    } else {
+      out += std::to_string(item);
+    }
+  }
+  return out;
+}
+
+// A value handed over once from the library's threads, awaited with a deadline.
+template <typename T>
+class Pending {
+ public:
+  auto setter() {
+    return [state = state_](T value) {
+      std::lock_guard<std::mutex> lock(state->mutex);
+      if (state->set) return;
+      state->set = true;
+      state->promise.set_value(std::move(value));
+    };
+  }
+  std::optional<T> wait(double seconds) {
+    auto deadline = std::chrono::duration<double>(seconds);
+    if (future_.wait_for(deadline) != std::future_status::ready) return std::nullopt;
+    return future_.get();
+  }
+
+ private:
+  struct State {
+    std::mutex mutex;
+    bool set = false;
+    std::promise<T> promise;
+  };
+  std::shared_ptr<State> state_ = std::make_shared<State>();
+  std::future<T> future_ = state_->promise.get_future();
+};
+
+// The reply texts of the daemon, printed after the session's own lines.
+class ReplyLog {
+ public:
+  Telvane::LoggingBlock block() {
+    return [this](const std::string& text) {
+      std::lock_guard<std::mutex> lock(mutex_);
+      texts_.push_back(text);
+    };
+  }
+  void print() {
+    std::lock_guard<std::mutex> lock(mutex_);
+    for (const auto& text : texts_) std::printf("reply: %s\n", text.c_str());
+  }
+
+ private:
+  std::mutex mutex_;
+  std::vector<std::string> texts_;
+};
+
+// Makes the session object, waiting up to the timeout for a daemon to listen.
+std::unique_ptr<Telvane> openSession(const ToolOptions& options, int& exitCode) {
+  const Value sessionInfo = telvane::tool::sessionInfoFor(options, static_cast<long long>(::getpid()));
+  const Value userInfo = telvane::tool::userInfoFor(options);
+  const std::string socketPath = telvane::ipcSocketPath();
+  if (::access(socketPath.c_str(), W_OK) != 0 && errno != ENOENT) {
+    exitCode = fail("not permitted to use the daemon's socket " + socketPath);
+    return nullptr;
+  }
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::duration<double>(options.timeoutSeconds);
+  for (;;) {
+    Error error;
+    error.code = 0;
+    auto session = Telvane::create(sessionInfo, userInfo, Value(), nullptr, &error);
+    if (session) return session;
+    if (error.code != 0) {
+      exitCode = fail("client creation refused: " + errorText(error));
+      return nullptr;
+    }
+    if (std::chrono::steady_clock::now() >= deadline) {
+      exitCode = fail("the daemon is not reachable at " + socketPath);
+      return nullptr;
+    }
+    std::this_thread::sleep_for(kConnectRetryMs);
+  }
+}
+
+// Starts the session and prints its states; false (with exitCode set) on a timeout.
+bool startSession(Telvane& session, const ToolOptions& options, int& exitCode) {
+  Pending<bool> started;
+  session.startConfigurationWithCompletionHandler(started.setter());
+  auto configured = started.wait(options.timeoutSeconds);
+  if (!configured) {
+    exitCode = fail("no start reply from the daemon within " + std::to_string(options.timeoutSeconds) + " s");
+    return false;
+  }
+  std::printf("start: %s\n", *configured ? "configured" : "not configured");
+  std::printf("enabled backends: %s\n", joined(session.enabledBackendNames()).c_str());
+  std::printf("whitelist: %s\n", joined(session.whitelistedEvents()).c_str());
+  std::printf("blacklist: %s\n", joined(session.blacklistedEvents()).c_str());
+  return true;
+}
+
+int sendEvents(Telvane& session, const ToolOptions& options) {
+  long long sent = 0, filtered = 0;
+  for (long long i = 0; i < options.count; ++i) {
+    telvane::Dictionary message{
+        {telvane::kTelvaneMessageParametersCategory, Value(options.category)},
+        {telvane::kTelvaneMessageParametersType, Value(options.type)},
+        {telvane::kTelvaneMessageParametersFlag, Value(options.flag)}};
+    if (!options.payload.isNull()) message.set(telvane::kTelvaneMessageParametersPayload, options.payload);
+    Error error;
+    if (session.sendMessageWithDictionary(Value(std::move(message)), &error)) {
+      ++sent;
+    } else if (!error.domain.empty()) {
+      return fail("event refused: " + errorText(error));
+    } else {
+      ++filtered;
+    }
+  }
+  std::printf("events: %lld sent, %lld filtered\n", sent, filtered);
+  Pending<std::optional<Error>> flushed;
+  session.flushMessagesWithCompletion(flushed.setter());
+  auto outcome = flushed.wait(options.timeoutSeconds);
+  if (!outcome) return fail("no flush reply from the daemon within " + std::to_string(options.timeoutSeconds) + " s");
+  if (*outcome) {
+    std::printf("flush: failed: %s\n", errorText(**outcome).c_str());
+    return kExitFailure;
+  }
+  std::printf("flush: ok\n");
+  return kExitOk;
+}
+
+int uploadFile(Telvane& session, const ToolOptions& options) {
+  std::printf("file upload supported: %s\n", session.serverSupportsFileUpload() ? "yes" : "no");
+  Pending<bool> uploaded;
+  if (!session.uploadFileWithURL(options.file, uploaded.setter())) {
+    return fail("cannot open " + options.file + " for reading");
+  }
+  auto outcome = uploaded.wait(options.timeoutSeconds);
+  if (!outcome) return fail("no upload reply from the daemon within " + std::to_string(options.timeoutSeconds) + " s");
+  std::printf("upload: %s\n", *outcome ? "succeeded" : "failed");
+  return *outcome ? kExitOk : kExitFailure;
+}
+
+int runSession(const ToolOptions& options) {
+  int exitCode = kExitOk;
+  ReplyLog replies;
+  {
+    std::unique_ptr<Telvane> session = openSession(options, exitCode);
+    if (!session) return exitCode;
+    session->setMessageLoggingBlock(replies.block());
+    if (!startSession(*session, options, exitCode)) return exitCode;
+    if (options.command == Command::Send) exitCode = sendEvents(*session, options);
+    if (options.command == Command::Upload) exitCode = uploadFile(*session, options);
+    session->finishSession();
+    // Going away hands the finish to the daemon and closes the connection.
+  }
+  std::fflush(stdout);
+  replies.print();
+  std::printf("session: finished\n");
+  return exitCode;
+}
+
+int runOneShot(const ToolOptions& options) {
+  const Value sessionInfo = telvane::tool::sessionInfoFor(options, static_cast<long long>(::getpid()));
+  const Value userInfo = telvane::tool::userInfoFor(options);
+  for (long long i = 0; i < options.count; ++i) {
+    Error error;
+    Pending<std::optional<std::string>> replied;
+    if (!Telvane::sendOneMessageWithSessionInfo(sessionInfo, userInfo, static_cast<std::uint16_t>(options.category),
+                                                static_cast<std::uint16_t>(options.type), options.payload, &error,
+                                                replied.setter())) {
+      return fail("event refused: " + errorText(error));
+    }
+    auto reply = replied.wait(options.timeoutSeconds);
+    if (!reply) return fail("no reply from the daemon within " + std::to_string(options.timeoutSeconds) + " s");
+    if (!*reply) return fail("the daemon is not reachable at " + telvane::ipcSocketPath());
+    std::printf("reply: %s\n", (*reply)->c_str());
+  }
+  return kExitOk;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  std::vector<std::string> arguments(argv + 1, argv + argc);
+  auto parsed = telvane::tool::parseToolOptions(arguments);
+  if (!parsed) {
+    std::fprintf(stderr, "telvane: %s\n%s", parsed.error().c_str(), telvane::tool::kToolUsage);
+    return kExitUsage;
+  }
+  const ToolOptions& options = parsed.value();
+  if (options.command == Command::Help) {
+    std::fputs(telvane::tool::kToolUsage, stdout);
+    return kExitOk;
+  }
+  telvane::log::useStandardError();
+  telvane::log::setLevel(options.verbose ? telvane::log::Level::Info : telvane::log::Level::Error);
+  const int exitCode = options.command == Command::OneShot ? runOneShot(options) : runSession(options);
+  std::fflush(stdout);
+  return exitCode;
+}
