@@ -152,6 +152,8 @@ void TelvanedAgent::updateSharedDataForSession(const SessionRef& session, const 
   if (const Dictionary* entries = sharedData.asDictionary()) {
     for (const auto& [key, value] : *entries) map.asDictionary()->set(key, value);
   }
+  log::debug("updateSharedDataForSession: hierarchyToken %s now shares %lu keys", *token,
+             static_cast<unsigned long>(map.asDictionary()->size()));
 }
 
 void TelvanedAgent::removeObjectFromSharedDataForSession(const SessionRef& session, const std::string& key) {
@@ -160,7 +162,11 @@ void TelvanedAgent::removeObjectFromSharedDataForSession(const SessionRef& sessi
   std::lock_guard<std::recursive_mutex> lock(lock_);
   auto map = sharedData_.find(*token);
   if (map == sharedData_.end()) return;
-  if (Dictionary* entries = map->second.asDictionary()) entries->erase(key);
+  if (Dictionary* entries = map->second.asDictionary()) {
+    entries->erase(key);
+    log::debug("removeObjectFromSharedDataForSession: hierarchyToken %s now shares %lu keys", *token,
+               static_cast<unsigned long>(entries->size()));
+  }
 }
 
 std::optional<Value> TelvanedAgent::sharedDataForSession(const SessionRef& session) {

@@ -233,6 +233,30 @@ TEST_F(HierarchyTest, SharedDataIsSharedByTheTokenAndAValuelessKeyRemoves) {
   EXPECT_EQ(sent[0].blob["SharedData"], Value(Dictionary{{"a", Value(1)}, {"c", Value("three")}}));
 }
 
+TEST_F(HierarchyTest, SharedDataChangesLogTheTokensKeyCount) {
+  auto root = member("T", 0, 1);
+  auto standalone = h.openWithInfo(sessionInfoMap(6, 2));
+  // A removal before the token has a map touches nothing.
+  root.client->send(ipc::Operation::UpdateSharedDataForKey, {Value("a"), Value()});
+  root.client->send(ipc::Operation::UpdateSharedDataWithDictionary,
+                    {Value(Dictionary{{"a", Value(1)}, {"b", Value(2)}})});
+  root.client->send(ipc::Operation::UpdateSharedDataForKey, {Value("a"), Value()});
+  ASSERT_TRUE(root.client->call(ipc::Operation::FetchDisplayURL, {}));
+  standalone.client->send(ipc::Operation::UpdateSharedDataForKey, {Value("k"), Value("v")});
+  standalone.client->send(ipc::Operation::UpdateSharedDataForKey, {Value("k"), Value()});
+  ASSERT_TRUE(standalone.client->call(ipc::Operation::FetchDisplayURL, {}));
+  std::vector<std::string> shared;
+  for (const auto& line : capture.lines()) {
+    if (line.text.find("SharedDataForSession: ") == std::string::npos) continue;
+    EXPECT_EQ(line.level, log::Level::Debug) << line.text;
+    shared.push_back(line.text);
+  }
+  EXPECT_EQ(shared, (std::vector<std::string>{
+                        "updateSharedDataForSession: hierarchyToken T now shares 2 keys",
+                        "removeObjectFromSharedDataForSession: hierarchyToken T now shares 1 keys",
+                    }));
+}
+
 TEST_F(HierarchyTest, TokenListAndSharedDataOutliveTheirSessions) {
   auto root = member("T", 0, 1);
   auto child = member("T", 1, 2);

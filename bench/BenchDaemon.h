@@ -1,0 +1,57 @@
+// BenchDaemon: one run of the real telvaned for the IPC load benchmark, on a socket
+// and with settings, cache, log and storage directories under a scratch folder, with
+// an entitlement for the benchmark's own uid and no storebag (so its sessions have no
+// backends). It reads the daemon's CPU time and peak memory from /proc.
+//
+// Threading: used by the benchmark's main thread only.
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace telvane::bench {
+
+class BenchDaemon {
+ public:
+  // `binary` is the telvaned executable; `logLevel` goes to TELVANE_LOG_LEVEL;
+  // `wrapper` (may be empty) is a command line put in front of the binary, such as
+  // "valgrind --tool=callgrind"; it must run the daemon in its own process (exec).
+  BenchDaemon(std::string binary, std::string directory, std::string logLevel, std::vector<std::string> wrapper);
+  ~BenchDaemon();
+  BenchDaemon(const BenchDaemon&) = delete;
+  BenchDaemon& operator=(const BenchDaemon&) = delete;
+
+  // Starts the daemon and waits until its socket accepts connections.
+  bool start(std::chrono::milliseconds timeout);
+  // SIGTERM and wait; the exit status, or -1 when it had to be killed.
+  int stop(std::chrono::milliseconds timeout);
+
+  pid_t pid() const { return pid_; }
+  const std::string& socketPath() const { return socketPath_; }
+  const std::string& logPath() const { return logPath_; }
+
+  // User plus system CPU time of all the daemon's threads, in seconds (clock-tick
+  // resolution), or nullopt when /proc cannot be read.
+  std::optional<double> cpuSeconds() const;
+  // VmHWM (peak resident set) in KiB.
+  std::optional<long> peakResidentKiB() const;
+  // Lines of the daemon's log that contain the text.
+  std::size_t countLogLinesContaining(const std::string& text) const;
+
+ private:
+  bool connectable() const;
+
+  std::string binary_;
+  std::string directory_;
+  std::string logLevel_;
+  std::vector<std::string> wrapper_;
+  std::string socketPath_;
+  std::string logPath_;
+  pid_t pid_ = -1;
+};
+
+}  // namespace telvane::bench
