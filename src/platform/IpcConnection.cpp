@@ -193,6 +193,13 @@ void IpcConnection::sendReply(std::uint64_t id, std::uint16_t code, Array argume
                description_, static_cast<unsigned long long>(id));
     return;
   }
+  // A reply given on the queue itself goes out at once, so that it keeps its place
+  // before an invalidate() made right after it (a session that refuses itself still
+  // answers the call that made it do so).
+  if (queue_->isCurrent()) {
+    if (!finished_) enqueueOnQueue(OutgoingFrame{std::move(frame), {}, 0});
+    return;
+  }
   queue_->async([self = shared_from_this(), frame = std::move(frame)]() mutable {
     if (!self->finished_) self->enqueueOnQueue(OutgoingFrame{std::move(frame), {}, 0});
   });
@@ -453,6 +460,11 @@ void IpcConnection::invalidate() {
 }
 
 void IpcConnection::finish(bool interrupted) {
+  if (finished_ || finishing_) return;
+  finishing_ = true;
+  // An explicit end still delivers what is already queued, as far as the socket takes
+  // it without waiting (a failed write ends up here again and returns above).
+  if (!interrupted && !writeWaiting_ && !output_.empty()) flushWrites();
   if (finished_.exchange(true)) return;
   std::error_code ignored;
   helloTimer_.cancel();

@@ -155,6 +155,7 @@ class IpcConnection : public std::enable_shared_from_this<IpcConnection> {
   bool resumed_ = false;
   bool helloReceived_ = false;
   bool writeWaiting_ = false;
+  bool finishing_ = false;
   std::string input_;
   std::size_t inputOffset_ = 0;
   std::deque<UniqueFd> receivedDescriptors_;

@@ -65,6 +65,23 @@ TEST(DaemonSessions, FiveSessionsOfOneTypeAreAcceptedAndTheSixthIsInvalidated) {
       "invalidateReportingSession: active session count for clientType 3 got decremented to 5"));
   for (auto& s : sessions) EXPECT_FALSE(s.waitEnded(0ms)) << "the five stay connected";
 
+  // A one-shot send of the same type is refused too, and says so in its reply before
+  // its connection ends.
+  {
+    auto connected = IpcConnection::connect(daemon.socketPath(), SerialQueue::create("e2e.oneshot"));
+    ASSERT_TRUE(connected.ok());
+    auto oneShot = connected.value();
+    oneShot->resume();
+    Value userInfo(Dictionary{{"_clientName", "demo"}});
+    auto reply = callAndWait(*oneShot, ipc::Operation::SendMessageWithSessionInfo,
+                             Array{sessionInfoFor(3, 8), userInfo, Value(5), Value(1), Value()});
+    ASSERT_TRUE(reply.has_value()) << "the refusal is answered";
+    EXPECT_EQ((*reply)[0].stringOrEmpty(),
+              "Exceeded maximum active reporting session limit for userInfo='" + userInfo.description() + "'");
+    ASSERT_TRUE(daemon.waitForLogLine(
+        "invalidateReportingSession: active session count for clientType 3 got decremented to 5", 20s, 2));
+  }
+
   // Once one of the five has gone, a new session of the type is accepted.
   sessions.front().connection->invalidate();
   ASSERT_TRUE(daemon.waitForLogLine(

@@ -304,3 +304,21 @@ TEST(IpcConnection, PeerThatNeverSaysHelloIsDisconnected) {
   EXPECT_TRUE(capture.contains(log::Level::Error, "IpcConnection: closing connection " + daemon->description() +
                                                       ": no hello within 50 ms"));
 }
+
+TEST(IpcConnection, ReplyGivenOnTheQueueBeforeInvalidateIsStillDelivered) {
+  Pair p = makePair();
+  p.daemon->setCallHandler([&](IpcConnection::IncomingCall& call) {
+    call.reply(Array{Value("refused")});
+    p.daemon->invalidate();
+  });
+  std::promise<std::string> reply;
+  std::promise<void> interrupted;
+  p.client->setInterruptionHandler([&] { interrupted.set_value(); });
+  p.daemon->resume();
+  p.client->resume();
+  p.client->call(ipc::Operation::FetchDisplayURL, Array{}, [&](Array r) { reply.set_value(r[0].stringOrEmpty()); });
+  auto f = reply.get_future();
+  EXPECT_EQ(waitFor(f), "refused");
+  auto g = interrupted.get_future();
+  waitFor(g);
+}
