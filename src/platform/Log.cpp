@@ -8,6 +8,9 @@
 #include <atomic>
 #include <cstdlib>
 #include <cstring>
+#include <string>
+
+#include <unistd.h>
 
 namespace telvane::log {
 
@@ -27,7 +30,9 @@ std::shared_ptr<spdlog::logger> makeLogger(bool journal) {
     sink = std::make_shared<spdlog::sinks::systemd_sink_mt>("", false);
   } else {
     sink = std::make_shared<spdlog::sinks::stderr_sink_mt>();
-    sink->set_pattern("%Y-%m-%d %H:%M:%S.%e [%P:%t] <%l> %v");
+    // The process id is written into the pattern once: "%P" would ask the kernel for
+    // it on every line.
+    sink->set_pattern("%Y-%m-%d %H:%M:%S.%e [" + std::to_string(::getpid()) + ":%t] <%l> %v");
   }
   auto logger = std::make_shared<spdlog::logger>("telvane", sink);
   logger->set_level(spdlog::level::trace);
