@@ -161,6 +161,10 @@ class Dictionary {
   const Value& get(std::string_view key) const;
 
   void set(std::string key, Value value);
+  // Adds an entry whose key sorts after every key present (decoders that read keys in
+  // order); a key equal to the last one replaces it. Anything else is a programmer
+  // error, checked in debug builds.
+  void appendInOrder(std::string key, Value value);
   // Returns true when the key was present.
   bool erase(std::string_view key);
   void clear() { entries_.clear(); }

@@ -352,7 +352,7 @@ bool IpcConnection::handleMessage(const std::uint8_t* body, std::size_t size) {
     fail("malformed message body: " + decoded.error());
     return false;
   }
-  const Array* message = decoded->asArray();
+  Array* message = decoded.value().asArray();
   std::uint64_t kind = 0, id = 0, code = 0, descriptorCount = 0;
   if (!message || message->size() != 5 || !headerField((*message)[0], kind) || !headerField((*message)[1], id) ||
       !headerField((*message)[2], code) || !(*message)[3].isArray() || !headerField((*message)[4], descriptorCount) ||
@@ -360,7 +360,7 @@ bool IpcConnection::handleMessage(const std::uint8_t* body, std::size_t size) {
     fail("malformed message: " + decoded->description().substr(0, 200));
     return false;
   }
-  Array arguments = *(*message)[3].asArray();
+  Array arguments = std::move(*(*message)[3].asArray());
   auto messageKind = static_cast<ipc::MessageKind>(kind);
   if (!helloReceived_) {
     if (messageKind != ipc::MessageKind::Hello) {

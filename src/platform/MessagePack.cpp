@@ -289,7 +289,7 @@ class Decoder {
       Value v;
       if (!key(k) || !value(v, depth + 1)) return false;
       if (ordered && (dict.empty() || k >= std::prev(dict.end())->first)) {
-        dict.set(std::move(k), std::move(v));
+        dict.appendInOrder(std::move(k), std::move(v));
         continue;
       }
       if (ordered) {

@@ -1,6 +1,7 @@
 #include "telvane/Value.h"
 
 #include <algorithm>
+#include <cassert>
 #include <cerrno>
 #include <cmath>
 #include <cstdio>
@@ -387,6 +388,15 @@ void Dictionary::set(std::string key, Value value) {
   } else {
     entries_.emplace(it, std::move(key), std::move(value));
   }
+}
+
+void Dictionary::appendInOrder(std::string key, Value value) {
+  if (!entries_.empty() && entries_.back().first == key) {
+    entries_.back().second = std::move(value);
+    return;
+  }
+  assert(entries_.empty() || entries_.back().first < key);
+  entries_.emplace_back(std::move(key), std::move(value));
 }
 
 bool Dictionary::erase(std::string_view key) {

@@ -446,3 +446,17 @@ TEST(ValueSizeTest, EstimateWrapsIn32Bits) {
 }
 
 }  // namespace
+
+TEST(Dictionary, AppendInOrderAddsAfterTheLastKeyAndReplacesAnEqualLastKey) {
+  telvane::Dictionary d;
+  d.appendInOrder("a", telvane::Value(1));
+  d.appendInOrder("b", telvane::Value(2));
+  d.appendInOrder("b", telvane::Value(3));
+  ASSERT_EQ(d.size(), 2u);
+  EXPECT_EQ(d.get("a").integerValue(), 1);
+  EXPECT_EQ(d.get("b").integerValue(), 3);
+  d.set("ab", telvane::Value(4));
+  std::vector<std::string> keys;
+  for (const auto& [k, v] : d) keys.push_back(k);
+  EXPECT_EQ(keys, (std::vector<std::string>{"a", "ab", "b"}));
+}
