@@ -58,9 +58,9 @@ Value eventPayload(const Value& base, long sequence) {
 int runBenchClient(const BenchClientOptions& options) {
   const Value sessionInfo(Dictionary{{kTelvaneSessionInfoClientType, Value(kBenchComponentType)},
                                      {kTelvaneSessionInfoSessionID, Value(kBenchFirstSessionID + options.index)}});
-  const Value userInfo(Dictionary{{kTelvaneUserInfoClientName, Value("telvane_ipc_load_bench")}});
+  // No user information: the session does not ask for any.
   Error error;
-  auto client = Telvane::create(sessionInfo, userInfo, Value(), nullptr, &error);
+  auto client = Telvane::create(sessionInfo, Value(), Value(), nullptr, &error);
   if (!client) {
     std::fprintf(stderr, "client %d: cannot create the session: %s (code %ld)\n", options.index,
                  error.description.c_str(), error.code);

@@ -41,9 +41,12 @@ struct RunResult {
 // logged by an info-level daemon) and marks the run failed otherwise.
 void verifyRun(RunResult& result);
 
-void printHeader(const std::string& daemon, const std::vector<std::string>& wrapper);
+void printHeader(const std::string& daemon, const std::vector<std::string>& wrapper,
+                 const std::vector<std::string>& attach);
 void printRun(const RunResult& result);
-// The table of all runs and the verdict on the CPU budget; false when a run failed.
-bool printSummary(const std::vector<RunResult>& results);
+// The table of all runs and the verdict on the CPU budget (none for a daemon run
+// under a wrapper, whose CPU time says nothing about the daemon's own); false when a
+// run failed.
+bool printSummary(const std::vector<RunResult>& results, bool wrapped);
 
 }  // namespace telvane::bench

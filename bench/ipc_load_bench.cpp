@@ -44,6 +44,7 @@ constexpr int kClientGoFd = 100;
 constexpr int kClientReportFd = 101;
 constexpr auto kDaemonStartTimeout = std::chrono::seconds(30);
 constexpr auto kDaemonStopTimeout = std::chrono::seconds(30);
+constexpr useconds_t kAttachSettleMicroseconds = 500'000;
 
 struct Options {
   std::string daemon = TELVANE_BENCH_DAEMON_PATH;
@@ -52,6 +53,7 @@ struct Options {
   std::vector<int> clients = {1, 4};
   std::vector<std::string> levels = {"error", "info"};
   std::vector<std::string> wrapper;
+  std::vector<std::string> attach;
   int timeoutSeconds = 600;
   bool keep = false;
 };
@@ -66,6 +68,9 @@ void printUsage() {
       "  --levels LIST          daemon log levels, e.g. error,info (default error,info)\n"
       "  --daemon-wrapper CMD   run the daemon under CMD (words split at spaces), e.g.\n"
       "                         \"valgrind --tool=callgrind --callgrind-out-file=/tmp/cg.out\"\n"
+      "  --attach CMD           run CMD -p <daemon pid> during each measured window and end\n"
+      "                         it with SIGINT; \"{run}\" in CMD becomes <level>-<clients>, e.g.\n"
+      "                         \"perf record -e cpu-clock -F 2000 -g -o /tmp/p-{run}.data\"\n"
       "  --timeout S            give up on a run after S seconds (default 600)\n"
       "  --keep                 keep the scratch directory (daemon logs)\n",
       TELVANE_BENCH_DAEMON_PATH);
@@ -108,6 +113,8 @@ std::optional<Options> parseOptions(int argc, char** argv) {
       options.levels = split(*value, ',');
     } else if (arg == "--daemon-wrapper") {
       options.wrapper = split(*value, ' ');
+    } else if (arg == "--attach") {
+      options.attach = split(*value, ' ');
     } else if (arg == "--timeout") {
       options.timeoutSeconds = std::atoi(value->c_str());
     } else {
@@ -201,6 +208,35 @@ std::optional<ClientProcesses> spawnClients(const std::string& self, int count, 
   return clients;
 }
 
+// Starts the attach command on the daemon, or returns -1 when there is none.
+// "{run}" in the command becomes the run's name ("<level>-<clients>").
+pid_t startAttached(const std::vector<std::string>& command, pid_t daemon, const std::string& run) {
+  if (command.empty()) return -1;
+  std::vector<std::string> args = command;
+  for (auto& a : args) {
+    if (auto at = a.find("{run}"); at != std::string::npos) a.replace(at, 5, run);
+  }
+  args.push_back("-p");
+  args.push_back(std::to_string(daemon));
+  std::vector<char*> argv;
+  for (auto& a : args) argv.push_back(a.data());
+  argv.push_back(nullptr);
+  pid_t pid = ::fork();
+  if (pid == 0) {
+    ::execvp(argv[0], argv.data());
+    ::_exit(127);
+  }
+  // A profiler needs a moment to attach; only profiling runs pay this.
+  if (pid > 0) ::usleep(kAttachSettleMicroseconds);
+  return pid;
+}
+
+void stopAttached(pid_t pid) {
+  if (pid <= 0) return;
+  ::kill(pid, SIGINT);
+  ::waitpid(pid, nullptr, 0);
+}
+
 // One configuration: a fresh daemon at the log level, `clientCount` clients.
 RunResult runOnce(const Options& options, const std::string& self, const std::string& scratch,
                   const std::string& level, int clientCount) {
@@ -258,12 +294,15 @@ RunResult runOnce(const Options& options, const std::string& self, const std::st
   };
 
   bool ok = collect(ReportKind::Ready);
+  const std::string runName = level + "-" + std::to_string(clientCount);
+  const pid_t attached = ok ? startAttached(options.attach, daemon.pid(), runName) : -1;
   std::optional<double> cpuBefore = daemon.cpuSeconds();
   const std::int64_t startNs = monotonicNanoseconds();
   ::close(goPipe[1]);  // the start signal
   ok = ok && collect(ReportKind::Done);
   std::optional<double> cpuAfter = daemon.cpuSeconds();
   result.peakResidentKiB = daemon.peakResidentKiB().value_or(-1);
+  stopAttached(attached);
   ::close(reportPipe[0]);
   if (!ok) clients->killAll();
   clients->reapAll();
@@ -326,7 +365,7 @@ int main(int argc, char** argv) {
   ::unsetenv("JOURNAL_STREAM");
   ::signal(SIGPIPE, SIG_IGN);
 
-  printHeader(options->daemon, options->wrapper);
+  printHeader(options->daemon, options->wrapper, options->attach);
   std::vector<RunResult> results;
   for (const auto& level : options->levels) {
     for (int clientCount : options->clients) {
@@ -335,7 +374,7 @@ int main(int argc, char** argv) {
       printRun(results.back());
     }
   }
-  const bool allOk = printSummary(results);
+  const bool allOk = printSummary(results, !options->wrapper.empty());
   if (options->keep) {
     std::printf("scratch directory kept: %s\n", scratch.c_str());
   } else {
