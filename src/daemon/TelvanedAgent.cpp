@@ -197,14 +197,81 @@ std::optional<std::string> TelvanedAgent::storebagVersionForSession(const Sessio
   return std::nullopt;
 }
 
-// The shared-helper registry arrives with the connectivity work; until then sessions
-// hold no helper and give their IPC transaction back themselves at teardown.
+// The registry of shared connectivity helpers lives on the state queue. A session
+// asks synchronously (it must not call from that queue) and gives back asynchronously.
 std::shared_ptr<ReportingSessionConnectivityHelper> TelvanedAgent::copySharedConnectivityHelperForReportingSession(
-    const SessionRef& /*session*/, std::int32_t /*mode*/) {
-  return nullptr;
+    const SessionRef& session, std::int32_t mode) {
+  if (!session) return nullptr;
+  const Value userInfo = session->userInfo();
+  if (!ReportingSessionConnectivityHelper::isValidUserInfo(userInfo)) return nullptr;
+  const std::string key = ReportingSessionConnectivityHelper::userInfoKey(userInfo);
+  std::shared_ptr<ReportingSessionConnectivityHelperImpl> helper;
+  stateQueue_->sync([&] {
+    log::info("requestSharedConnectivityHelperForReportingSession: Requesting shared connectivity helper for "
+              "userInfoKey %s",
+              key);
+    auto it = sharedConnectivityHelpers_.find(key);
+    if (it == sharedConnectivityHelpers_.end()) {
+      log::info("requestSharedConnectivityHelperForReportingSession: Creating shared connectivity helper for "
+                "userInfoKey %s",
+                key);
+      helper = ReportingSessionConnectivityHelperImpl::create(weak_from_this(), mode, userInfo);
+      sharedConnectivityHelpers_[key] = helper;
+    } else {
+      // An existing helper keeps its own mode.
+      log::info("requestSharedConnectivityHelperForReportingSession: Found existing shared connectivity helper for "
+                "userInfoKey %s",
+                key);
+      helper = it->second;
+    }
+    log::info("requestSharedConnectivityHelperForReportingSession: Incrementing usage of shared connectivity helper "
+              "for userInfoKey %s",
+              key);
+    helper->ownerIncrementUsageCount();
+  });
+  return helper;
 }
 
-void TelvanedAgent::releaseSharedConnectivityHelperForReportingSession(const SessionRef& /*session*/) {}
+void TelvanedAgent::releaseSharedConnectivityHelperForReportingSession(const SessionRef& session) {
+  if (!session) return;
+  const std::string key = ReportingSessionConnectivityHelper::userInfoKey(session->userInfo());
+  stateQueue_->async([self = shared_from_this(), key] {
+    log::info("releaseSharedConnectivityHelperForReportingSession: Releasing shared connectivity helper for "
+              "userInfoKey %s",
+              key);
+    auto it = self->sharedConnectivityHelpers_.find(key);
+    if (it == self->sharedConnectivityHelpers_.end()) return;
+    log::info("releaseSharedConnectivityHelperForReportingSession: Decrementing usage count of shared connectivity "
+              "helper for userInfoKey %s",
+              key);
+    std::weak_ptr<TelvanedAgent> weakAgent = self;
+    it->second->ownerDecrementUsageCountWithBlock(
+        [weakAgent, key](std::uint32_t usageCount) {
+          auto agent = weakAgent.lock();
+          if (!agent || usageCount != 0) return;
+          // Runs on the state queue.
+          log::info("releaseSharedConnectivityHelperForReportingSession: Usage count of shared connectivity helper "
+                    "for userInfoKey %s reached zero. Invalidating the helper",
+                    key);
+          auto found = agent->sharedConnectivityHelpers_.find(key);
+          if (found == agent->sharedConnectivityHelpers_.end()) return;
+          auto helper = found->second;
+          agent->sharedConnectivityHelpers_.erase(found);
+          helper->invalidate();
+        },
+        self->stateQueue_);
+  });
+}
+
+std::shared_ptr<ReportingSessionConnectivityHelperImpl> TelvanedAgent::sharedConnectivityHelperForKey(
+    const std::string& userInfoKey) const {
+  std::shared_ptr<ReportingSessionConnectivityHelperImpl> helper;
+  stateQueue_->sync([&] {
+    auto it = sharedConnectivityHelpers_.find(userInfoKey);
+    if (it != sharedConnectivityHelpers_.end()) helper = it->second;
+  });
+  return helper;
+}
 
 // ---- For tests and logs ----
 

@@ -33,6 +33,7 @@
 #include <string>
 #include <vector>
 
+#include "connectivity/ReportingSessionConnectivityHelperImpl.h"
 #include "platform/IpcConnection.h"
 #include "platform/KeepAlive.h"
 #include "platform/SerialQueue.h"
@@ -122,6 +123,9 @@ class TelvanedAgent : public TelvanedSessionDelegate, public std::enable_shared_
   // A copy of the token's shared data, or nothing.
   std::optional<Value> sharedDataForToken(const std::string& token) const;
   const SessionEnvironment& environment() const { return options_.environment; }
+  // The shared connectivity helper registered under the user-info key, or nullptr.
+  std::shared_ptr<ReportingSessionConnectivityHelperImpl> sharedConnectivityHelperForKey(
+      const std::string& userInfoKey) const;
   const std::shared_ptr<SerialQueue>& stateQueue() const { return stateQueue_; }
 
  private:
@@ -135,8 +139,11 @@ class TelvanedAgent : public TelvanedSessionDelegate, public std::enable_shared_
 
   // Constant after construction.
   const Options options_;
-  // Serves the shared-helper registry (arrives with the connectivity work).
+  // Serves the shared-helper registry.
   const std::shared_ptr<SerialQueue> stateQueue_;
+
+  // Shared connectivity helpers by user-info key; touched only on stateQueue_.
+  std::map<std::string, std::shared_ptr<ReportingSessionConnectivityHelperImpl>> sharedConnectivityHelpers_;
 
   // Guarded by lock_.
   mutable std::recursive_mutex lock_;

@@ -71,6 +71,7 @@ int main(int argc, char** argv) {
 
   setUtilityQualityOfService();
   log::info("startLogging: Daemon starts logging...");
+  ReportingSessionConnectivityHelper::cleanupStorageRootFolder();
 
   auto listenerQueue = SerialQueue::create("com.zembra.telvaned.listener");
   std::shared_ptr<TelvanedAgent> agent;
