@@ -357,13 +357,16 @@ TEST_F(HttpEngineTest, ManySessionsRunAtOnce) {
   ScriptedAnswer answer;
   answer.body = "b";
   server.setAnswer("/many", answer);
-  std::vector<std::shared_ptr<HttpSession>> sessions;
+  // The recorders outlive the sessions, so that no callback can reach a freed one.
+  // The count stays within the test server's worker threads, which each hold a kept-
+  // alive connection until it times out.
   std::vector<std::unique_ptr<Recorder>> recorders;
+  std::vector<std::shared_ptr<HttpSession>> sessions;
   HttpRequest request;
   request.url = server.url("/many");
-  for (int i = 0; i < 8; ++i) {
+  for (int i = 0; i < 4; ++i) {
     sessions.push_back(HttpSession::create(queue));
-    for (int j = 0; j < 3; ++j) {
+    for (int j = 0; j < 2; ++j) {
       recorders.push_back(std::make_unique<Recorder>());
       sessions.back()->startTask(request, recorders.back()->callbacks(queue));
     }
@@ -372,7 +375,7 @@ TEST_F(HttpEngineTest, ManySessionsRunAtOnce) {
     ASSERT_TRUE(waitUntil([&] { return recorder->done(); }));
     EXPECT_EQ(recorder->result().body, "b");
   }
-  EXPECT_EQ(server.requestCount(), 24u);
+  EXPECT_EQ(server.requestCount(), 8u);
 }
 
 }  // namespace
