@@ -1,6 +1,7 @@
 #include "platform/ReadSource.h"
 
 #include "platform/Log.h"
+#include "support/Counter.h"
 
 #include <gtest/gtest.h>
 
@@ -26,27 +27,7 @@ namespace {
 
 constexpr auto kDeadline = 10s;
 
-class Counter {
- public:
-  void add() {
-    std::lock_guard<std::mutex> lock(mutex_);
-    ++count_;
-    cv_.notify_all();
-  }
-  bool waitFor(int n, std::chrono::milliseconds timeout = kDeadline) {
-    std::unique_lock<std::mutex> lock(mutex_);
-    return cv_.wait_for(lock, timeout, [&] { return count_ >= n; });
-  }
-  int value() {
-    std::lock_guard<std::mutex> lock(mutex_);
-    return count_;
-  }
-
- private:
-  std::mutex mutex_;
-  std::condition_variable cv_;
-  int count_ = 0;
-};
+using test::Counter;
 
 std::string receiveOne(int fd) {
   char buffer[256];
