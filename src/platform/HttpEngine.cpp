@@ -159,7 +159,20 @@ class Engine {
     event.events = EPOLLIN;
     event.data.fd = wakeFd_;
     epoll_ctl(epollFd_, EPOLL_CTL_ADD, wakeFd_, &event);
-    std::thread([this] { run(); }).detach();
+    thread_ = std::thread([this] { run(); });
+    // OpenSSL frees its global locks in an exit handler registered when it was first
+    // initialised, at the latest by curl_global_init above. Exit handlers run in
+    // reverse order, so this one stops the network thread before that happens: a
+    // connection pool torn down during exit must not take a lock that is gone.
+    std::atexit([] { Engine::instance().stopAtExit(); });
+  }
+
+  void stopAtExit() {
+    stopping_ = true;
+    std::uint64_t one = 1;
+    ssize_t written = ::write(wakeFd_, &one, sizeof one);
+    (void)written;
+    if (thread_.joinable()) thread_.join();
   }
 
   void run();
@@ -173,6 +186,8 @@ class Engine {
 
   int epollFd_ = -1;
   int wakeFd_ = -1;
+  std::thread thread_;
+  std::atomic<bool> stopping_{false};
   std::atomic<std::uint64_t> poolCounter_{0};
   std::atomic<std::uint64_t> taskCounter_{0};
   std::mutex mutex_;
@@ -289,7 +304,7 @@ void Engine::releasePool(std::map<std::uint64_t, std::unique_ptr<Pool>>::iterato
 void Engine::run() {
   pthread_setname_np(pthread_self(), "telvane-http");
   std::vector<epoll_event> events(64);
-  for (;;) {
+  while (!stopping_) {
     auto wait = nextWait(std::chrono::steady_clock::now());
     int count = epoll_wait(epollFd_, events.data(), static_cast<int>(events.size()), static_cast<int>(wait.count()));
     for (int i = 0; i < count; ++i) {
