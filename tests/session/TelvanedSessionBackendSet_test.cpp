@@ -25,14 +25,8 @@ std::vector<std::int64_t> integers(const std::optional<Array>& list) {
   return out;
 }
 
-class BackendSetTest : public ::testing::Test {
+class BackendSetTest : public SessionTest {
  protected:
-  std::shared_ptr<FakeBackend> addBackend(const std::string& name, BackendKind kind = BackendKind::HTTPSPost) {
-    auto backend = std::make_shared<FakeBackend>(name, kind);
-    env.backends->add(backend);
-    return backend;
-  }
-
   // Builds the backends from the section and brings their states up to date.
   void build(SessionTestHarness& h, const Value& section = Value::dictionary()) {
     h.run([&] {
@@ -40,9 +34,6 @@ class BackendSetTest : public ::testing::Test {
       h.session()->updateReportingStates();
     });
   }
-
-  log::LogCapture capture;
-  TestEnvironment env;
 };
 
 TEST_F(BackendSetTest, CreationLogsStampsTheIdentifierAndDefaultsTheReleaseTimeout) {

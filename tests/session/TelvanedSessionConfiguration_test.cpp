@@ -19,18 +19,7 @@ Value userInfoMap(const std::string& client, const std::string& service) {
   return Value(Dictionary{{"_clientName", Value(client)}, {"_serviceName", Value(service)}});
 }
 
-class SessionConfigurationTest : public ::testing::Test {
- protected:
-  // A started session over one HTTPS post backend named "a-splunk".
-  std::shared_ptr<FakeBackend> addBackend(const std::string& name = "a-splunk") {
-    auto backend = std::make_shared<FakeBackend>(name);
-    env.backends->add(backend);
-    return backend;
-  }
-
-  log::LogCapture capture;
-  TestEnvironment env;
-};
+using SessionConfigurationTest = SessionTest;
 
 TEST_F(SessionConfigurationTest, SetSessionInfoConfiguresTheSession) {
   SessionTestHarness h(env);

@@ -27,14 +27,8 @@ Value userInfoMap(const std::string& client, const std::string& service) {
   return Value(Dictionary{{"_clientName", Value(client)}, {"_serviceName", Value(service)}});
 }
 
-class MessagePathTest : public ::testing::Test {
+class MessagePathTest : public SessionTest {
  protected:
-  std::shared_ptr<FakeBackend> addBackend(const std::string& name, BackendKind kind = BackendKind::HTTPSPost) {
-    auto backend = std::make_shared<FakeBackend>(name, kind);
-    env.backends->add(backend);
-    return backend;
-  }
-
   // Configures and starts the session (the start message reaches the backends).
   void start(SessionTestHarness& h, bool aggregator = false, Dictionary extraInfo = {}) {
     h.delegate()->setStorebag(Value::dictionary());
@@ -47,9 +41,6 @@ class MessagePathTest : public ::testing::Test {
     auto reply = h.client().call(ipc::Operation::SendMessageWithDictionary, {m});
     return reply ? (*reply)[0] : Value("no reply");
   }
-
-  log::LogCapture capture;
-  TestEnvironment env;
 };
 
 TEST_F(MessagePathTest, SendWithoutBackendsRepliesNothing) {

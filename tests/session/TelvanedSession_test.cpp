@@ -28,18 +28,7 @@ bool appearInOrder(const std::vector<std::string>& lines, const std::vector<std:
   return next == expected.size();
 }
 
-class TelvanedSessionTest : public ::testing::Test {
- protected:
-  // A started session over one HTTPS post backend named "a-splunk".
-  std::shared_ptr<FakeBackend> addBackend(const std::string& name = "a-splunk") {
-    auto backend = std::make_shared<FakeBackend>(name);
-    env.backends->add(backend);
-    return backend;
-  }
-
-  log::LogCapture capture;
-  TestEnvironment env;
-};
+using TelvanedSessionTest = SessionTest;
 
 TEST_F(TelvanedSessionTest, CreationLogsAndMakesABase64Identifier) {
   SessionTestHarness h(env);

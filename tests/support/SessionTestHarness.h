@@ -17,7 +17,10 @@
 #include <string>
 #include <vector>
 
+#include <gtest/gtest.h>
+
 #include "platform/DeviceFacts.h"
+#include "platform/Log.h"
 #include "platform/SettingsStore.h"
 #include "session/ClientSessionInterface.h"
 #include "session/SessionEnvironment.h"
@@ -138,5 +141,20 @@ inline Value sessionInfoMap(long componentType, unsigned sessionID, Dictionary e
 inline Value hierarchyToken(const std::string& token, long level) {
   return Value(Dictionary{{"token", Value(token)}, {"level", Value(level)}});
 }
+
+// The common fixture of the session tests: a log capture, a test environment, and
+// backends added to what the environment's factory yields.
+class SessionTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<FakeBackend> addBackend(const std::string& name = "a-splunk",
+                                          BackendKind kind = BackendKind::HTTPSPost) {
+    auto backend = std::make_shared<FakeBackend>(name, kind);
+    env.backends->add(backend);
+    return backend;
+  }
+
+  log::LogCapture capture;
+  TestEnvironment env;
+};
 
 }  // namespace telvane::test
