@@ -1,6 +1,7 @@
 #include "platform/ReadSource.h"
 
 #include "platform/Log.h"
+#include "platform/SourceCancellation.h"
 
 #include <asio/bind_executor.hpp>
 
@@ -61,12 +62,7 @@ void ReadSource::cancel() {
     cancelHandler = std::move(cancelHandler_);
     handler = std::move(handler_);
   }
-  queue_->async([self = shared_from_this(), cancelHandler = std::move(cancelHandler),
-                 handler = std::move(handler)]() mutable {
-    if (cancelHandler) cancelHandler();
-    cancelHandler = nullptr;
-    handler.reset();
-  });
+  detail::runCancelActionOnQueue(*queue_, shared_from_this(), std::move(cancelHandler), std::move(handler));
 }
 
 bool ReadSource::isCanceled() const {

@@ -1,4 +1,5 @@
 #include "platform/TimerSource.h"
+#include "platform/SourceCancellation.h"
 
 #include <asio/bind_executor.hpp>
 
@@ -52,13 +53,7 @@ void TimerSource::cancel() {
     cancelHandler = std::move(cancelHandler_);
     handler = std::move(handler_);
   }
-  // The handlers' captures are released on the queue, after the cancel action.
-  queue_->async([self = shared_from_this(), cancelHandler = std::move(cancelHandler),
-                 handler = std::move(handler)]() mutable {
-    if (cancelHandler) cancelHandler();
-    cancelHandler = nullptr;
-    handler.reset();
-  });
+  detail::runCancelActionOnQueue(*queue_, shared_from_this(), std::move(cancelHandler), std::move(handler));
 }
 
 bool TimerSource::isCanceled() const {
