@@ -59,6 +59,8 @@ class ReportingSessionConnectivityHelperImpl : public ReportingSessionConnectivi
     // How long one of the helper's "seconds" lasts (release timeout, pull delay), so
     // that tests can run the timing rules quickly. Unset: one second.
     std::chrono::milliseconds secondDuration{1000};
+    // Delayed pulls wait a random whole number of seconds below this (at least 1).
+    std::uint32_t pullDelayRangeSeconds = kPullDelayRangeSeconds;
   };
 
   using OwnerBlock = std::function<void(std::uint32_t usageCount)>;

@@ -1,5 +1,6 @@
 // The helper's requests: POST (plain or through a container file), GET with its
 // per-URL suppression and delayed pull, and the HTTP session's callbacks.
+#include <algorithm>
 #include <cstdio>
 #include <fstream>
 
@@ -117,7 +118,7 @@ void ReportingSessionConnectivityHelperImpl::getURLRequestWithCompletionHandler(
     });
     return;
   }
-  const std::uint32_t delaySeconds = random_->uniform(kPullDelayRangeSeconds);
+  const std::uint32_t delaySeconds = random_->uniform(std::max<std::uint32_t>(1, options_.pullDelayRangeSeconds));
   const std::uint64_t now = monotonicNowNs();
   const std::uint64_t scheduled =
       now + static_cast<std::uint64_t>(

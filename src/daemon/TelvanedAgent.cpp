@@ -20,7 +20,9 @@ std::shared_ptr<TelvanedAgent> TelvanedAgent::create(Options options) {
 }
 
 TelvanedAgent::TelvanedAgent(Options options)
-    : options_(std::move(options)), stateQueue_(SerialQueue::create(kStateQueueLabel)) {}
+    : options_(std::move(options)),
+      stateQueue_(SerialQueue::create(kStateQueueLabel)),
+      storebagCache_(lock_, options_.storebagSelector, options_.storebagFileTime, options_.environment.clock) {}
 
 TelvanedAgent::~TelvanedAgent() = default;
 
@@ -185,16 +187,24 @@ ReportingAgentState TelvanedAgent::copyReportingAgentState() {
   std::lock_guard<std::recursive_mutex> lock(lock_);
   ReportingAgentState state;
   state.sessionList = sessionList_;
-  state.cachedStorebags = cachedStorebags_.copy();
+  state.cachedStorebags = storebagCache_.copyCachedStorebags();
   return state;
 }
 
-// The storebag cache arrives with the storebag work; until then no session finds a
-// storebag, so none builds backends.
-std::optional<Value> TelvanedAgent::storebagForSession(const SessionRef& /*session*/) { return std::nullopt; }
+std::optional<Value> TelvanedAgent::storebagForSession(const SessionRef& session) {
+  if (!session || !options_.storebagSelector) return std::nullopt;
+  const std::int32_t clientType = session->sessionInfo()[keys::kSessionInfoComponentType].intValue();
+  return storebagCache_.storebagForSession(session->sessionID(), clientType);
+}
 
-std::optional<std::string> TelvanedAgent::storebagVersionForSession(const SessionRef& /*session*/) {
-  return std::nullopt;
+std::optional<std::string> TelvanedAgent::storebagVersionForSession(const SessionRef& session) {
+  if (!session) return std::nullopt;
+  const std::int32_t clientType = session->sessionInfo()[keys::kSessionInfoComponentType].intValue();
+  return storebagCache_.storebagVersionForSession(clientType);
+}
+
+void TelvanedAgent::fetchAndCacheStorebag(std::int32_t clientType) {
+  if (options_.storebagSelector) storebagCache_.fetchAndCacheStorebag(clientType);
 }
 
 // The registry of shared connectivity helpers lives on the state queue. A session

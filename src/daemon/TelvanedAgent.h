@@ -39,6 +39,7 @@
 #include "platform/SerialQueue.h"
 #include "platform/UniqueFd.h"
 #include "session/SessionEnvironment.h"
+#include "storebag/AgentStorebagCache.h"
 #include "session/TelvanedSession.h"
 #include "session/TelvanedSessionDelegate.h"
 #include "telvane/Value.h"
@@ -69,6 +70,11 @@ class TelvanedAgent : public TelvanedSessionDelegate, public std::enable_shared_
     SessionEnvironment environment;
     // How long a client may take to say hello; unset: the connection's default.
     std::optional<std::chrono::milliseconds> helloTimeout;
+    // Selects a client type's storebag section (the signed retrieval and the choice
+    // of environment). Unset: no storebag is ever found, so no session has backends.
+    AgentStorebagCache::Selector storebagSelector;
+    // The modification time of a storebag name's disk-cache file.
+    AgentStorebagCache::FileTime storebagFileTime;
   };
 
   static std::shared_ptr<TelvanedAgent> create(Options options);
@@ -92,6 +98,8 @@ class TelvanedAgent : public TelvanedSessionDelegate, public std::enable_shared_
   // ---- TelvanedSessionDelegate ----
   std::optional<Value> storebagForSession(const SessionRef& session) override;
   std::optional<std::string> storebagVersionForSession(const SessionRef& session) override;
+  // Refreshes the cache entry of the client type's storebag name.
+  void fetchAndCacheStorebag(std::int32_t clientType);
   std::optional<std::string> parentSessionIDStringForSession(const SessionRef& session) override;
   void updateCorrelatedSessions(const SessionRef& session) override;
   SessionRef getAncestorWithAggregatorForSession(const SessionRef& session) override;
@@ -148,7 +156,8 @@ class TelvanedAgent : public TelvanedSessionDelegate, public std::enable_shared_
   // Guarded by lock_.
   mutable std::recursive_mutex lock_;
   std::vector<SessionRef> sessionList_;
-  Value cachedStorebags_ = Value::dictionary();
+  // Takes lock_ itself.
+  AgentStorebagCache storebagCache_;
   std::map<std::string, std::vector<SessionRef>> correlatedSessions_;
   std::map<std::string, Value> sharedData_;
   std::int32_t IPCTransactionReference_ = 0;

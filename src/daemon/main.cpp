@@ -26,6 +26,8 @@
 #include "platform/Paths.h"
 #include "platform/SerialQueue.h"
 #include "platform/SystemInfo.h"
+#include "storebag/StorebagDocument.h"
+#include "storebag/StorebagRetrieval.h"
 
 namespace {
 
@@ -41,7 +43,11 @@ void printUsage() {
       "  TELVANED_IDLE_EXIT_SECONDS   exit after this long without sessions (0: never)\n"
       "  TELVANED_HELLO_TIMEOUT_SECONDS  how long a new client may take to say hello (10)\n"
       "  TELVANED_DEVICE_INFO         device-information override file\n"
-      "  TELVANE_DEFAULTS_DB          settings database\n"
+      "  TELVANE_DEFAULTS_DB          settings database (the storebag server: telvane_storebag_url)\n"
+      "  TELVANED_CA_FILE             extra trusted certificates (PEM) for the HTTPS servers\n"
+      "  TELVANED_PUBLIC_KEY          storebag signature key (DER)\n"
+      "  TELVANED_CACHE_DIR           storebag disk cache parent folder\n"
+      "  TELVANED_STOREBAG_REFRESH_SPREAD_SECONDS  spread of background storebag refreshes (7200)\n"
       "  TELVANE_LOG_LEVEL            debug, info or error\n");
 }
 
@@ -96,6 +102,15 @@ int main(int argc, char** argv) {
       options.helloTimeout = std::chrono::milliseconds(static_cast<long long>(seconds * 1000));
     }
   }
+  // The storebag retrieval lives as long as the process, like its GET helper.
+  static StorebagRetrieval storebagRetrieval{StorebagRetrieval::Options{}};
+  options.storebagSelector = [](std::int32_t clientType) {
+    return fetchStorebagForEnvironmentAndClientType(clientType, storebagRetrieval.fetcher(),
+                                                    [] { return userDefaultsEnvironment(); });
+  };
+  options.storebagFileTime = [](const std::string& name) {
+    return storebagRetrieval.diskCache().modificationTime(name);
+  };
   agent = TelvanedAgent::create(std::move(options));
   listener->resume();
   log::info("main: Listener resumes with sandbox, start loop.");
