@@ -4,13 +4,18 @@
 // environment sections, shared-value macros in every profile, and about 50 KB of
 // envelope.
 #include <benchmark/benchmark.h>
+#include <fcntl.h>
+#include <unistd.h>
 
 #include <cstdio>
 #include <cstdlib>
+#include <mutex>
 #include <string>
 
 #include "platform/Log.h"
 #include "platform/PropertyList.h"
+#include "platform/Clock.h"
+#include "storebag/AgentStorebagCache.h"
 #include "storebag/StorebagEnvelope.h"
 #include "storebag/StorebagSigner.h"
 
@@ -88,6 +93,48 @@ void BM_CheckEnvelopeOnly(benchmark::State& state) {
   }
 }
 BENCHMARK(BM_CheckEnvelopeOnly);
+
+// The agent's cache serving a session whose storebag entry is fresh: what every
+// session start and every message pays once the storebag has been fetched. Argument:
+// 1 with the daemon's info lines (two per call) written to a discarded sink, 0 with
+// logging at error level.
+void BM_AgentCacheStorebagForSession(benchmark::State& state) {
+  const bool infoLogging = state.range(0) != 0;
+  log::setLevel(infoLogging ? log::Level::Info : log::Level::Error);
+  // The log lines go to standard error: point it at /dev/null for the run.
+  int savedStderr = -1;
+  if (infoLogging) {
+    std::fflush(stderr);
+    savedStderr = ::dup(STDERR_FILENO);
+    int null = ::open("/dev/null", O_WRONLY);
+    ::dup2(null, STDERR_FILENO);
+    ::close(null);
+  }
+  std::recursive_mutex agentLock;
+  Value section = makeDocument(0)["release"];
+  AgentStorebagCache cache(
+      agentLock,
+      [&section](std::int32_t) {
+        StorebagSelectionResult result;
+        result.selection = StorebagSelection{section, 3600, "bench-1"};
+        result.maxAgeSeconds = 3600;
+        return result;
+      },
+      [](const std::string&) -> std::optional<double> { return std::nullopt; }, Clock::system());
+  cache.fetchAndCacheStorebag(7);
+  for (auto _ : state) {
+    std::optional<Value> found = cache.storebagForSession(42, 11);
+    if (!found) state.SkipWithError("no cached section");
+    benchmark::DoNotOptimize(found);
+  }
+  if (savedStderr >= 0) {
+    std::fflush(stderr);
+    ::dup2(savedStderr, STDERR_FILENO);
+    ::close(savedStderr);
+  }
+  log::setLevel(log::Level::Error);
+}
+BENCHMARK(BM_AgentCacheStorebagForSession)->Arg(0)->Arg(1);
 
 }  // namespace
 
