@@ -29,6 +29,7 @@ namespace {
 using SteadyTime = std::chrono::steady_clock::time_point;
 constexpr const char* kIdleTimeoutError = "The request timed out.";
 constexpr std::chrono::milliseconds kLongestWaitMs{1000};
+constexpr long kMaxConnectionsPerHost = 4;
 
 // Certificates of $TELVANED_CA_FILE, freed with the last request that uses them.
 struct ExtraCertificates {
@@ -38,9 +39,7 @@ struct ExtraCertificates {
   }
 };
 
-std::shared_ptr<ExtraCertificates> loadExtraCertificates() {
-  const char* path = std::getenv("TELVANED_CA_FILE");
-  if (!path || !*path) return nullptr;
+std::shared_ptr<ExtraCertificates> readExtraCertificates(const char* path) {
   BIO* bio = BIO_new_file(path, "r");
   if (!bio) {
     ERR_clear_error();
@@ -58,6 +57,22 @@ std::shared_ptr<ExtraCertificates> loadExtraCertificates() {
     return nullptr;
   }
   return extra;
+}
+
+// The certificates of $TELVANED_CA_FILE, read once per path: parsing them (and the
+// system bundle) for every connection would cost more than the request itself.
+std::shared_ptr<ExtraCertificates> loadExtraCertificates() {
+  static std::mutex mutex;
+  static std::string loadedPath;
+  static std::shared_ptr<ExtraCertificates> loaded;
+  const char* path = std::getenv("TELVANED_CA_FILE");
+  if (!path || !*path) return nullptr;
+  std::lock_guard<std::mutex> lock(mutex);
+  if (path != loadedPath) {
+    loaded = readExtraCertificates(path);
+    loadedPath = path;
+  }
+  return loaded;
 }
 
 }  // namespace
@@ -241,6 +256,10 @@ void Engine::createPool(std::uint64_t id, std::shared_ptr<SerialQueue> queue) {
   curl_multi_setopt(pool->multi, CURLMOPT_TIMERFUNCTION, &Engine::timerCallback);
   curl_multi_setopt(pool->multi, CURLMOPT_TIMERDATA, pool.get());
   curl_multi_setopt(pool->multi, CURLMOPT_PIPELINING, CURLPIPE_MULTIPLEX);
+  // Requests beyond this many per host wait for a free connection instead of opening
+  // (and paying the TLS handshake of) a new one each; under load this keeps a few warm
+  // connections busy rather than churning through new ones.
+  curl_multi_setopt(pool->multi, CURLMOPT_MAX_HOST_CONNECTIONS, kMaxConnectionsPerHost);
   pools_[id] = std::move(pool);
 }
 
@@ -553,8 +572,8 @@ std::string configure(Task& task, HttpRequest& request) {
   if (task.extraCertificates) {
     curl_easy_setopt(easy, CURLOPT_SSL_CTX_FUNCTION, &sslContextCallback);
     curl_easy_setopt(easy, CURLOPT_SSL_CTX_DATA, &task);
-    // A cached store is shared by later requests: keep the extra CAs to this one.
-    curl_easy_setopt(easy, CURLOPT_CA_CACHE_TIMEOUT, 0L);
+    // The store may be the pool's cached one, shared by later connections; they trust
+    // the same extra certificates, and adding one twice is harmless.
   }
   return {};
 }
