@@ -216,8 +216,8 @@ std::optional<Bytes> StorebagRetrieval::fetchNetworkStorebag(const std::string& 
     } else {
       errorText = describeError(result->error, result->response);
     }
-    log::error("fetchNetworkStorebag: Error resolving with lookup server %s, sendSynchronousRequest error %s", url,
-               errorText);
+    log::info("fetchNetworkStorebag: Error resolving with lookup server %s, sendSynchronousRequest error %s", url,
+              errorText);
     if (name == kFallbackStorebagName) {
       log::info("fetchNetworkStorebag: Loading default storebag '%s'", name);
       return defaultStorebagData();
