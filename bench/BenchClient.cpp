@@ -55,6 +55,10 @@ Value eventPayload(const Value& base, long sequence) {
 
 }  // namespace
 
+void writeReport(int fd, const Report& report) { sendReport(fd, report); }
+
+std::int64_t monotonicNowNs() { return monotonicNanoseconds(); }
+
 int runBenchClient(const BenchClientOptions& options) {
   const Value sessionInfo(Dictionary{{kTelvaneSessionInfoClientType, Value(kBenchComponentType)},
                                      {kTelvaneSessionInfoSessionID, Value(kBenchFirstSessionID + options.index)}});

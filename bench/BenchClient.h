@@ -17,6 +17,7 @@ enum class ReportKind : std::int32_t {
   Ready = 1,   // started; a = 1 when the start reply carried a list of backends
   Done = 2,    // a = CLOCK_MONOTONIC nanoseconds of the flush reply, b = refused sends
   Failed = 3,  // a = the stage that failed (FailedStage)
+  Info = 4,    // a, b: details a benchmark defines for itself (others skip it)
 };
 
 enum class FailedStage : std::int64_t {
@@ -40,6 +41,12 @@ struct BenchClientOptions {
   int reportFd = -1;  // write end of the report pipe
   int timeoutSeconds = 600;
 };
+
+// Writes one report whole to the pipe; nothing when the reader is gone.
+void writeReport(int fd, const Report& report);
+// CLOCK_MONOTONIC in nanoseconds: the clock of the reports' time stamps, the same in
+// every process of the machine.
+std::int64_t monotonicNowNs();
 
 // Runs one client; the process's exit code.
 int runBenchClient(const BenchClientOptions& options);

@@ -42,6 +42,10 @@ BenchDaemon::~BenchDaemon() {
   }
 }
 
+void BenchDaemon::setEnvironment(const std::string& key, const std::string& value) {
+  extraEnvironment_[key] = value;
+}
+
 bool BenchDaemon::start(std::chrono::milliseconds timeout) {
   namespace fs = std::filesystem;
   std::error_code ignored;
@@ -54,7 +58,7 @@ bool BenchDaemon::start(std::chrono::milliseconds timeout) {
   std::map<std::string, std::string> settings = {
       {"TELVANED_SOCKET", socketPath_},
       {"TELVANED_ENTITLEMENTS_DIR", directory_ + "/entitlements.d"},
-      {"TELVANE_DEFAULTS_DB", directory_ + "/defaults.sqlite3"},
+      {"TELVANE_DEFAULTS_DB", defaultsPath()},
       {"TELVANED_CACHE_DIR", directory_ + "/cache"},
       {"TELVANED_MESSAGE_LOG_DIR", directory_ + "/messagelogs"},
       {"TELVANED_STORAGE_DIR", directory_ + "/storage"},
@@ -62,6 +66,7 @@ bool BenchDaemon::start(std::chrono::milliseconds timeout) {
       {"TELVANED_IDLE_EXIT_SECONDS", "0"},
       {"TELVANE_LOG_LEVEL", logLevel_},
   };
+  for (const auto& [key, value] : extraEnvironment_) settings[key] = value;
   // Our environment minus anything of a service manager (JOURNAL_STREAM would send
   // the daemon's log to the journal), plus the daemon's settings.
   std::vector<std::string> env;
@@ -173,6 +178,16 @@ std::optional<long> BenchDaemon::peakResidentKiB() const {
   std::string line;
   while (std::getline(in, line)) {
     if (line.rfind("VmHWM:", 0) == 0) return std::stol(line.substr(6));
+  }
+  return std::nullopt;
+}
+
+std::optional<long> BenchDaemon::residentKiB() const {
+  if (pid_ <= 0) return std::nullopt;
+  std::ifstream in("/proc/" + std::to_string(pid_) + "/status");
+  std::string line;
+  while (std::getline(in, line)) {
+    if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
   }
   return std::nullopt;
 }
