@@ -13,6 +13,7 @@
 #include <cstdint>
 #include <cstring>
 #include <limits>
+#include <memory>
 #include <vector>
 
 #include "platform/Crypto.h"
@@ -292,6 +293,91 @@ Result<std::string> write(const Value& value, bool pretty) {
 }
 
 bool writeTo(std::string& out, const Value& value, bool pretty) { return writeAny(out, value, pretty, nullptr); }
+
+namespace {
+
+// Scratch buffers of the object writers of this thread, one per nesting level; kept
+// for reuse so that objects written one after another allocate nothing.
+struct ObjectBuffers {
+  std::vector<std::unique_ptr<rapidjson::StringBuffer>> buffers;
+  std::size_t depth = 0;
+};
+thread_local ObjectBuffers tObjectBuffers;
+
+rapidjson::StringBuffer& bufferOf(void* buffer) { return *static_cast<rapidjson::StringBuffer*>(buffer); }
+
+void appendRaw(rapidjson::StringBuffer& buffer, std::string_view text) {
+  if (text.empty()) return;
+  std::memcpy(buffer.Push(text.size()), text.data(), text.size());
+}
+
+// Appends the key as a JSON string; false when it cannot be one.
+bool appendKey(rapidjson::StringBuffer& buffer, std::string_view key) {
+  if (key.size() > std::numeric_limits<rapidjson::SizeType>::max() || !isValidUtf8(key)) return false;
+  CompactWriter writer(buffer);
+  return writer.String(key.data(), static_cast<rapidjson::SizeType>(key.size()));
+}
+
+}  // namespace
+
+ObjectWriter::ObjectWriter(std::string& out) : out_(out) {
+  ObjectBuffers& buffers = tObjectBuffers;
+  if (buffers.depth == buffers.buffers.size()) buffers.buffers.push_back(std::make_unique<rapidjson::StringBuffer>());
+  rapidjson::StringBuffer& buffer = *buffers.buffers[buffers.depth++];
+  buffer.Clear();
+  buffer.Put('{');
+  buffer_ = &buffer;
+}
+
+ObjectWriter::~ObjectWriter() {
+  rapidjson::StringBuffer& buffer = bufferOf(buffer_);
+  if (buffer.GetSize() > kKeptBufferBytes) {
+    buffer.Clear();
+    buffer.ShrinkToFit();
+  }
+  --tObjectBuffers.depth;
+}
+
+bool ObjectWriter::member(std::string_view key, const Value& value) {
+  rapidjson::StringBuffer& buffer = bufferOf(buffer_);
+  const std::size_t mark = buffer.GetSize();
+  if (!first_) buffer.Put(',');
+  bool ok = appendKey(buffer, key);
+  if (ok) {
+    buffer.Put(':');
+    // A writer per value: a refused value leaves no writer state behind to undo.
+    CompactWriter writer(buffer);
+    ValueWriter<CompactWriter> valueWriter(writer);
+    ok = valueWriter.write(value, 0);
+  }
+  if (!ok) {
+    buffer.Pop(buffer.GetSize() - mark);
+    return false;
+  }
+  first_ = false;
+  return true;
+}
+
+bool ObjectWriter::rawMember(std::string_view key, std::string_view json) {
+  rapidjson::StringBuffer& buffer = bufferOf(buffer_);
+  const std::size_t mark = buffer.GetSize();
+  if (!first_) buffer.Put(',');
+  if (!appendKey(buffer, key)) {
+    buffer.Pop(buffer.GetSize() - mark);
+    return false;
+  }
+  buffer.Put(':');
+  appendRaw(buffer, json);
+  first_ = false;
+  return true;
+}
+
+void ObjectWriter::finish() {
+  rapidjson::StringBuffer& buffer = bufferOf(buffer_);
+  buffer.Put('}');
+  out_.append(buffer.GetString(), buffer.GetSize());
+  buffer.Clear();
+}
 
 Result<Value> parse(std::string_view text) {
   rapidjson::MemoryStream stream(text.data(), text.size());

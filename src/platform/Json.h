@@ -37,6 +37,31 @@ Result<std::string> write(const Value& value, bool pretty = false);
 // returns false and leaves `out` exactly as it was.
 bool writeTo(std::string& out, const Value& value, bool pretty = false);
 
+// Writes one JSON object member by member, with the rules of write() (compact form),
+// for callers that assemble an object from several sources without building a Value
+// first. Members are written into a per-thread scratch buffer; finish() appends the
+// object ("{", the members, "}") to `out`. A member whose key or value cannot be
+// written is refused and leaves no trace. Writers on one thread nest (each takes its
+// own buffer) but must end in reverse order of creation; an unfinished object is
+// dropped.
+class ObjectWriter {
+ public:
+  explicit ObjectWriter(std::string& out);
+  ~ObjectWriter();
+  ObjectWriter(const ObjectWriter&) = delete;
+  ObjectWriter& operator=(const ObjectWriter&) = delete;
+
+  bool member(std::string_view key, const Value& value);
+  // A member whose value is JSON text made elsewhere; the text is not checked.
+  bool rawMember(std::string_view key, std::string_view json);
+  void finish();
+
+ private:
+  std::string& out_;
+  void* buffer_;  // the scratch buffer this writer took
+  bool first_ = true;
+};
+
 // One JSON document (any value at the top); whitespace may surround it, nothing else.
 Result<Value> parse(std::string_view text);
 

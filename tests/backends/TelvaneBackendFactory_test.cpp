@@ -1,0 +1,153 @@
+#include "backends/TelvaneBackendFactory.h"
+
+#include <gtest/gtest.h>
+
+#include "backends/BackendTestSupport.h"
+#include "storebag/StorebagBackends.h"
+
+namespace telvane {
+namespace {
+
+class TelvaneBackendFactoryTest : public test::BackendTestBase {
+ protected:
+  Value httpsProfile() { return test::profileWithRules({test::enablingRule()}); }
+};
+
+TEST_F(TelvaneBackendFactoryTest, NamesPickTheirClassInTableOrder) {
+  std::optional<std::string> model = "Board9";
+  EXPECT_EQ(backendKindForName("dashboard", model), BackendKind::Dashboard);
+  EXPECT_EQ(backendKindForName("upload_server", model), BackendKind::Upload);
+  EXPECT_EQ(backendKindForName("splunk", model), BackendKind::HTTPSPost);
+  EXPECT_EQ(backendKindForName("my-splunk-prod", model), BackendKind::HTTPSPost);
+  EXPECT_EQ(backendKindForName("brindle", model), BackendKind::HTTPSPost);
+  EXPECT_EQ(backendKindForName("power", model), BackendKind::Joulemeter);
+  EXPECT_EQ(backendKindForName("quarl", model), BackendKind::HTTPSPost);
+  EXPECT_EQ(backendKindForName("metrix", model), BackendKind::Metrix);
+  EXPECT_EQ(backendKindForName("metrix", std::nullopt), BackendKind::Metrix);
+}
+
+TEST_F(TelvaneBackendFactoryTest, OtherNamesMustMatchWholeAndInTheirCase) {
+  std::optional<std::string> model = "Board9";
+  for (const char* name : {"Dashboard", "dashboard2", "Brindle", "quarl ", "SPLUNK", "release_timeout", "", "powers"}) {
+    EXPECT_EQ(backendKindForName(name, model), std::nullopt) << name;
+  }
+  EXPECT_EQ(backendKindForName("metrix", std::string("Maravel")), std::nullopt);
+  EXPECT_EQ(backendKindForName("metrix", std::string("maravel")), BackendKind::Metrix);
+}
+
+TEST_F(TelvaneBackendFactoryTest, ANameContainingSplunkMakesAnHTTPSPostBackend) {
+  auto backend = newBackendWithName("my-splunk-prod", httpsProfile(), std::string("Laptop"), 7, platform());
+  ASSERT_NE(backend, nullptr);
+  EXPECT_EQ(backend->kind(), BackendKind::HTTPSPost);
+  EXPECT_NE(dynamic_cast<HTTPSPostBackend*>(backend.get()), nullptr);
+  EXPECT_EQ(backend->name(), "my-splunk-prod");
+  EXPECT_EQ(backend->displayURL(), std::optional<std::string>("collector.test"));
+  EXPECT_FALSE(capture.containsPrefix("TelvaneBackend(newBackendWithName)"));
+}
+
+TEST_F(TelvaneBackendFactoryTest, DashboardWithACapitalLetterCreatesNothing) {
+  EXPECT_EQ(newBackendWithName("Dashboard", httpsProfile(), std::string("Laptop"), 7, platform()), nullptr);
+  EXPECT_TRUE(capture.contains(log::Level::Error, "TelvaneBackend(newBackendWithName): Dashboard"));
+}
+
+TEST_F(TelvaneBackendFactoryTest, MetrixOnAMaravelDeviceCreatesNothingAndLogs) {
+  deviceFacts["ProductType"] = "Maravel";
+  EXPECT_EQ(newBackendWithName("metrix", Value(Dictionary{{"active", Value(true)}}), std::string("Laptop"), 7,
+                               platform()),
+            nullptr);
+  EXPECT_TRUE(capture.contains(log::Level::Error, "TelvaneBackend(newBackendWithName): metrix"));
+}
+
+TEST_F(TelvaneBackendFactoryTest, BackendsOfLaterClassesAreNotMadeYet) {
+  for (const char* name : {"dashboard", "upload_server", "power", "metrix"}) {
+    capture.clear();
+    EXPECT_EQ(newBackendWithName(name, Value::dictionary(), std::string("Laptop"), 7, platform()), nullptr) << name;
+    EXPECT_TRUE(capture.contains(log::Level::Error, std::string("TelvaneBackend(newBackendWithName): ") + name));
+  }
+}
+
+TEST_F(TelvaneBackendFactoryTest, AnHTTPSProfileWithoutClientsCreatesNothing) {
+  const Value profiles[] = {Value(Dictionary{{"display_url", Value("x")}}),
+                            Value(Dictionary{{"clients", Value::array()}}),
+                            Value(Dictionary{{"clients", Value("everyone")}}),
+                            Value(Dictionary{{"clients", Value::dictionary()}}), Value("not a profile")};
+  for (const Value& profile : profiles) {
+    capture.clear();
+    EXPECT_EQ(newBackendWithName("quarl", profile, std::string("Laptop"), 7, platform()), nullptr)
+        << profile.description();
+    EXPECT_TRUE(capture.contains(log::Level::Error, "HTTPSPostBackend(initWithName): can't find the client list."));
+    EXPECT_FALSE(capture.containsPrefix("TelvaneBackend(newBackendWithName)"));
+  }
+}
+
+TEST_F(TelvaneBackendFactoryTest, AnHTTPSBackendNeedsAProfileAndAProductFamily) {
+  EXPECT_EQ(newBackendWithName("quarl", Value(), std::string("Laptop"), 7, platform()), nullptr);
+  EXPECT_EQ(newBackendWithName("quarl", httpsProfile(), std::nullopt, 7, platform()), nullptr);
+  EXPECT_TRUE(capture.lines().empty());
+}
+
+TEST_F(TelvaneBackendFactoryTest, TheEntryFactoryAppliesEverySessionSetting) {
+  BackendServices services;
+  services.deviceInfo = std::make_shared<DeviceInfo>(makeFixedDeviceFacts(
+      {{"ProductVersion", "12.4"}, {"BuildVersion", "B77"}, {"ProductType", "Board9"}, {"DeviceName", "Laptop"}}));
+  services.internalBuild = true;
+  services.frameworkBundleVersion = [] { return std::optional<std::string>("3.4.5"); };
+  services.clock = std::make_shared<test::ManualClock>(1'700'000'123.5);
+
+  Value section(Dictionary{{"my-splunk-prod", httpsProfile()},
+                           {"quarl", httpsProfile()},
+                           {"dashboard", Value::dictionary()},
+                           {"release_timeout", Value(30)}});
+  Value sessionInfo(Dictionary{{"SessionID", Value(4242)},
+                               {"ComponentType", Value(28)},
+                               {"ClientVersion", Value(70000)},
+                               {"BatchEvents", Value(true)},
+                               {"RequireUserDict", Value(false)}});
+  auto factory = makeStorebagBackendFactory(makeTelvaneBackendEntryFactory(platform()), services);
+  BackendMap backends = factory(section, sessionInfo, test::userInfo("app", "svc"), "device-7");
+
+  ASSERT_EQ(backends.size(), 2u);
+  EXPECT_TRUE(capture.contains(log::Level::Error, "TelvaneBackend(newBackendWithName): dashboard"));
+  EXPECT_TRUE(capture.contains(log::Level::Error, "TelvaneBackend(newBackendWithName): release_timeout"));
+  for (const char* name : {"my-splunk-prod", "quarl"}) {
+    ASSERT_TRUE(backends.count(name)) << name;
+    auto* backend = dynamic_cast<HTTPSPostBackend*>(backends[name].get());
+    ASSERT_NE(backend, nullptr);
+    EXPECT_EQ(backend->sessionID(), 4242u);
+    EXPECT_EQ(backend->compType(), 28);
+    EXPECT_EQ(backend->clientVersion(), static_cast<std::uint16_t>(70000));
+    EXPECT_EQ(backend->udid(), "device-7");
+    EXPECT_EQ(backend->productVersion(), std::optional<std::string>("12.4"));
+    EXPECT_EQ(backend->buildVersion(), std::optional<std::string>("B77"));
+    EXPECT_EQ(backend->hardwareType(), std::optional<std::string>("Board9"));
+    EXPECT_EQ(backend->productFamily(), std::optional<std::string>("Laptop"));
+    EXPECT_TRUE(backend->isInternal());
+    EXPECT_FALSE(backend->requireUserInfo());
+    EXPECT_TRUE(backend->batchEvents());
+    EXPECT_TRUE(backend->allowNestedData());  // client type 28
+    EXPECT_EQ(backend->userInfoDict()["_clientName"], Value("app"));
+    EXPECT_EQ(backend->selfVersionMajor(), 3);
+    EXPECT_EQ(backend->selfVersionMiddle(), 4);
+    EXPECT_EQ(backend->selfVersionMinor(), 5);
+    EXPECT_DOUBLE_EQ(backend->startTimeStamp(), 1'700'000'123.5);
+    EXPECT_EQ(backend->state(), kBackendStatePending);
+  }
+}
+
+TEST_F(TelvaneBackendFactoryTest, BadSessionValuesBecomeZerosNotCrashes) {
+  BackendSettings settings;
+  settings.sessionIdentifier = "not a number";
+  settings.daemonVersion = "junk";
+  settings.userInfo = Value("not a map");
+  auto backend = newBackendWithName("brindle", httpsProfile(), std::string("Laptop"), 7, platform());
+  ASSERT_NE(backend, nullptr);
+  applyBackendSettings(*backend, settings);
+  EXPECT_EQ(backend->sessionID(), 0u);
+  EXPECT_EQ(backend->selfVersionMajor(), 0);
+  // User information that is not a map counts as none.
+  backend->setRequireUserInfo(true);
+  EXPECT_EQ(backend->updateState(), kBackendStatePending);
+}
+
+}  // namespace
+}  // namespace telvane
