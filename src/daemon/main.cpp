@@ -18,6 +18,7 @@
 #include <memory>
 #include <string>
 
+#include "backends/TelvaneBackendFactory.h"
 #include "daemon/TelvanedAgent.h"
 #include "platform/Executors.h"
 #include "platform/IpcListener.h"
@@ -26,6 +27,7 @@
 #include "platform/Paths.h"
 #include "platform/SerialQueue.h"
 #include "platform/SystemInfo.h"
+#include "storebag/StorebagBackends.h"
 #include "storebag/StorebagDocument.h"
 #include "storebag/StorebagRetrieval.h"
 
@@ -111,6 +113,11 @@ int main(int argc, char** argv) {
   options.storebagFileTime = [](const std::string& name) {
     return storebagRetrieval.diskCache().modificationTime(name);
   };
+  // Sessions make their backends from their storebag section through the factory.
+  BackendPlatform backendPlatform;
+  backendPlatform.environmentType = [] { return lastUserDefaultsEnvironment(); };
+  options.environment.backendFactory =
+      makeStorebagBackendFactory(makeTelvaneBackendEntryFactory(std::move(backendPlatform)));
   agent = TelvanedAgent::create(std::move(options));
   listener->resume();
   log::info("main: Listener resumes with sandbox, start loop.");

@@ -133,7 +133,18 @@ void TelvanedSession::receivedUserInfo(const Value& userInfo) {
 }
 
 void TelvanedSession::updateSessionWithDefaultSessionInfo() {
-  if (updateReportingStates()) {
+  bool activate = updateReportingStates();
+  if (!activate) {
+    // A deferred backend (sampled out, kept by the sampling override) becomes enabled
+    // by a later promoting event without another state evaluation; its posts need an
+    // active helper then, so deferred counts for the activation too.
+    if (auto backends = this->backends()) {
+      for (const auto& [name, backend] : *backends) {
+        if (backend->state() == kBackendStateDeferred) activate = true;
+      }
+    }
+  }
+  if (activate) {
     std::shared_ptr<ReportingSessionConnectivityHelper> helper;
     std::uint32_t releaseTimeout;
     {
