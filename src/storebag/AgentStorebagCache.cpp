@@ -12,6 +12,14 @@ namespace {
 
 std::string describeTime(double secondsSince1970) { return Value::date(secondsSince1970).description(); }
 
+// The section an entry holds, or nothing when it has none (no entry, or no success yet).
+std::optional<Value> sectionOf(const Value* entry) {
+  if (!entry) return std::nullopt;
+  const Value& data = (*entry)[kStorebagEntryData];
+  if (data.isNull()) return std::nullopt;
+  return data;
+}
+
 }  // namespace
 
 AgentStorebagCache::AgentStorebagCache(std::recursive_mutex& lock, Selector selector, FileTime fileTime,
@@ -42,23 +50,15 @@ std::optional<Value> AgentStorebagCache::storebagForSession(std::uint32_t sessio
                 *name, describeTime(*fileTime), describeTime(fetchTime));
     } else if (succeeded && elapsed < static_cast<double>(maxAge)) {
       log::info("storebagForSession: Cached storebag found for client type %d", clientType);
-      const Value& data = (*entry)[kStorebagEntryData];
-      if (data.isNull()) return std::nullopt;
-      return data;
+      return sectionOf(entry);
     } else if (!succeeded && elapsed < kStorebagRetryIntervalSeconds) {
       log::info("storebagForSession: Not fetching storebag for client type %d - must wait %d seconds between attempts",
                 clientType, kStorebagRetryIntervalSeconds);
-      const Value& data = (*entry)[kStorebagEntryData];
-      if (data.isNull()) return std::nullopt;
-      return data;
+      return sectionOf(entry);
     }
   }
   fetchAndCacheStorebag(clientType);
-  const Value* entry = cachedStorebags_.asDictionary()->find(*name);
-  if (!entry) return std::nullopt;
-  const Value& data = (*entry)[kStorebagEntryData];
-  if (data.isNull()) return std::nullopt;
-  return data;
+  return sectionOf(cachedStorebags_.asDictionary()->find(*name));
 }
 
 std::optional<std::string> AgentStorebagCache::storebagVersionForSession(std::int32_t clientType) {
