@@ -59,6 +59,16 @@ void writeReport(int fd, const Report& report) { sendReport(fd, report); }
 
 std::int64_t monotonicNowNs() { return monotonicNanoseconds(); }
 
+std::optional<FlushReply> flushAndWait(Telvane& client, int timeoutSeconds) {
+  auto flushed = std::make_shared<std::promise<FlushReply>>();
+  auto future = flushed->get_future();
+  client.flushMessagesWithCompletion([flushed](const std::optional<Error>& error) {
+    flushed->set_value(FlushReply{monotonicNanoseconds(), error});
+  });
+  if (future.wait_for(std::chrono::seconds(timeoutSeconds)) != std::future_status::ready) return std::nullopt;
+  return future.get();
+}
+
 int runBenchClient(const BenchClientOptions& options) {
   const Value sessionInfo(Dictionary{{kTelvaneSessionInfoClientType, Value(kBenchComponentType)},
                                      {kTelvaneSessionInfoSessionID, Value(kBenchFirstSessionID + options.index)}});
@@ -101,29 +111,18 @@ int runBenchClient(const BenchClientOptions& options) {
     if (!client->sendMessageWithCategory(kBenchCategory, kBenchType, eventPayload(base, i))) ++refused;
   }
 
-  // One connection's calls are handled in order: the flush reply comes after the
-  // daemon has handled every event sent before it.
-  struct FlushOutcome {
-    std::int64_t repliedAtNs = 0;
-    std::optional<Error> error;
-  };
-  auto flushed = std::make_shared<std::promise<FlushOutcome>>();
-  auto flushedFuture = flushed->get_future();
-  client->flushMessagesWithCompletion([flushed](const std::optional<Error>& flushError) {
-    flushed->set_value(FlushOutcome{monotonicNanoseconds(), flushError});
-  });
-  if (flushedFuture.wait_for(std::chrono::seconds(options.timeoutSeconds)) != std::future_status::ready) {
+  std::optional<FlushReply> outcome = flushAndWait(*client, options.timeoutSeconds);
+  if (!outcome) {
     std::fprintf(stderr, "client %d: no flush reply within %d s\n", options.index, options.timeoutSeconds);
     return fail(options, FailedStage::FlushReply);
   }
-  FlushOutcome outcome = flushedFuture.get();
   // A session without backends answers the flush with exactly this refusal; any other
   // error (the connection broke, no proxy) means the daemon did not answer.
-  if (outcome.error && outcome.error->description != kNoBackendsReply) {
-    std::fprintf(stderr, "client %d: flush failed: %s\n", options.index, outcome.error->description.c_str());
+  if (outcome->error && outcome->error->description != kNoBackendsReply) {
+    std::fprintf(stderr, "client %d: flush failed: %s\n", options.index, outcome->error->description.c_str());
     return fail(options, FailedStage::FlushError);
   }
-  sendReport(options.reportFd, Report{options.index, ReportKind::Done, outcome.repliedAtNs, refused});
+  sendReport(options.reportFd, Report{options.index, ReportKind::Done, outcome->repliedAtNs, refused});
   ::close(options.reportFd);
   client.reset();
   return 0;

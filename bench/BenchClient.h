@@ -10,6 +10,13 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
+
+#include "telvane/Error.h"
+
+namespace telvane {
+class Telvane;
+}
 
 namespace telvane::bench {
 
@@ -47,6 +54,16 @@ void writeReport(int fd, const Report& report);
 // CLOCK_MONOTONIC in nanoseconds: the clock of the reports' time stamps, the same in
 // every process of the machine.
 std::int64_t monotonicNowNs();
+
+// What a flush reply said and when it arrived.
+struct FlushReply {
+  std::int64_t repliedAtNs = 0;  // monotonicNowNs() at the reply
+  std::optional<Error> error;
+};
+// Flushes the session and waits for the daemon's reply; nothing when none came within
+// the time. One connection's calls are handled in order, so the reply comes after the
+// daemon has handled every event sent before the flush.
+std::optional<FlushReply> flushAndWait(Telvane& client, int timeoutSeconds);
 
 // Runs one client; the process's exit code.
 int runBenchClient(const BenchClientOptions& options);

@@ -110,20 +110,12 @@ int runLoad(const DeliveryClientOptions& options) {
   writeReport(options.reportFd, Report{options.index, ReportKind::Info,
                                        static_cast<std::int64_t>(DeliveryInfo::AllSent), refused});
 
-  struct Flushed {
-    std::int64_t repliedAtNs = 0;
-    std::optional<Error> error;
-  };
-  auto flushed = std::make_shared<std::promise<Flushed>>();
-  auto future = flushed->get_future();
-  client->flushMessagesWithCompletion([flushed](const std::optional<Error>& error) {
-    flushed->set_value(Flushed{monotonicNowNs(), error});
-  });
-  if (future.wait_for(std::chrono::seconds(options.timeoutSeconds)) != std::future_status::ready) {
+  std::optional<FlushReply> reply = flushAndWait(*client, options.timeoutSeconds);
+  if (!reply) {
     std::fprintf(stderr, "delivery client %d: no flush reply within %d s\n", options.index, options.timeoutSeconds);
     return fail(options, FailedStage::FlushReply);
   }
-  Flushed outcome = future.get();
+  const FlushReply& outcome = *reply;
   FlushOutcome code = FlushOutcome::Succeeded;
   if (outcome.error) {
     code = outcome.error->description == kNoBackendsReply ? FlushOutcome::NoBackends : FlushOutcome::OtherError;
