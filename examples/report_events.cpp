@@ -127,10 +127,11 @@ int main(int argc, char** argv) {
     return 1;
   }
   call->setMessageLoggingBlock([](const std::string& text) { std::printf("call: daemon says: %s\n", text.c_str()); });
-  bool answered = start(*call, "call");
-
   // Shared data reaches every session of the hierarchy and travels with their events.
+  // It is set before the start: the start's reply then also confirms that the daemon
+  // has it, so the child session below, on a connection of its own, cannot overtake it.
   call->updateSharedDataWithDictionary(Value(Dictionary{{"callID", Value("C-2041")}, {"network", Value("wifi")}}));
+  bool answered = start(*call, "call");
 
   for (long i = 0; i < eventCount; ++i) {
     Value payload(Dictionary{{"codec", Value("opus")},

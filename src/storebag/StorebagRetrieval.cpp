@@ -66,7 +66,7 @@ StorebagRetrieval::StorebagRetrieval(Options options)
 StorebagRetrieval::~StorebagRetrieval() = default;
 
 std::string StorebagRetrieval::builtInServerBaseURL(bool internalBuild) {
-  return internalBuild ? TELVANE_STOREBAG_URL_INTERNAL : TELVANE_STOREBAG_URL_RELEASE;
+  return internalBuild ? TELVANE_STOREBAG_SERVER_INTERNAL : TELVANE_STOREBAG_SERVER_RELEASE;
 }
 
 std::string StorebagRetrieval::storebagServerBaseURL() const {
