@@ -7,6 +7,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
@@ -198,6 +200,26 @@ std::size_t BenchDaemon::countLogLinesContaining(const std::string& text) const 
   std::size_t count = 0;
   while (std::getline(in, line)) count += line.find(text) != std::string::npos;
   return count;
+}
+
+std::optional<BenchPrelude> prepareBenchRun(const std::string& daemonPath, const std::string& scratchPrefix) {
+  BenchPrelude prelude;
+  std::error_code error;
+  prelude.self = std::filesystem::read_symlink("/proc/self/exe", error).string();
+  if (error || !std::filesystem::exists(daemonPath)) {
+    std::fprintf(stderr, "cannot find %s\n", error ? "/proc/self/exe" : daemonPath.c_str());
+    return std::nullopt;
+  }
+  std::string scratchTemplate = "/tmp/" + scratchPrefix + "-XXXXXX";
+  if (!::mkdtemp(scratchTemplate.data())) {
+    std::perror("mkdtemp");
+    return std::nullopt;
+  }
+  prelude.scratch = scratchTemplate;
+  ::setenv("TELVANE_LOG_LEVEL", "error", 1);
+  ::unsetenv("JOURNAL_STREAM");
+  ::signal(SIGPIPE, SIG_IGN);
+  return prelude;
 }
 
 }  // namespace telvane::bench

@@ -67,4 +67,15 @@ class BenchDaemon {
   pid_t pid_ = -1;
 };
 
+// What a load benchmark does before its runs: finds this program (the clients are
+// this program run again) and the daemon, makes the scratch folder
+// "/tmp/<scratchPrefix>-XXXXXX", makes the clients log only errors to standard error
+// (their logging would compete with the daemon for the CPU) and ignores SIGPIPE.
+// Nothing, after a message on standard error, when something is missing.
+struct BenchPrelude {
+  std::string self;     // this program's path
+  std::string scratch;  // the new scratch folder
+};
+std::optional<BenchPrelude> prepareBenchRun(const std::string& daemonPath, const std::string& scratchPrefix);
+
 }  // namespace telvane::bench

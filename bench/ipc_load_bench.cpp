@@ -347,23 +347,10 @@ int main(int argc, char** argv) {
     printUsage();
     return 2;
   }
-  std::error_code error;
-  const std::string self = std::filesystem::read_symlink("/proc/self/exe", error).string();
-  if (error || !std::filesystem::exists(options->daemon)) {
-    std::fprintf(stderr, "cannot find %s\n", error ? "/proc/self/exe" : options->daemon.c_str());
-    return 1;
-  }
-  char scratchTemplate[] = "/tmp/telvane-ipc-bench-XXXXXX";
-  if (!::mkdtemp(scratchTemplate)) {
-    std::perror("mkdtemp");
-    return 1;
-  }
-  const std::string scratch = scratchTemplate;
-  // The clients log only errors, so that their own logging does not compete with the
-  // daemon for the CPU; their errors go to our standard error, not to a journal.
-  ::setenv("TELVANE_LOG_LEVEL", "error", 1);
-  ::unsetenv("JOURNAL_STREAM");
-  ::signal(SIGPIPE, SIG_IGN);
+  auto prelude = prepareBenchRun(options->daemon, "telvane-ipc-bench");
+  if (!prelude) return 1;
+  const std::string& self = prelude->self;
+  const std::string& scratch = prelude->scratch;
 
   printHeader(options->daemon, options->wrapper, options->attach);
   std::vector<RunResult> results;
@@ -378,7 +365,8 @@ int main(int argc, char** argv) {
   if (options->keep) {
     std::printf("scratch directory kept: %s\n", scratch.c_str());
   } else {
-    std::filesystem::remove_all(scratch, error);
+    std::error_code ignored;
+    std::filesystem::remove_all(scratch, ignored);
   }
   return allOk ? 0 : 1;
 }
