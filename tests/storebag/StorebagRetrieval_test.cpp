@@ -147,6 +147,18 @@ class StorebagRetrievalTest : public ::testing::Test {
 
   std::optional<Value> storedMetric(const std::string& key) { return settings->read(kTelvaneSettingsDomain, key); }
 
+  // Both metrics of the name as stored: the max age, and the Last-Modified value
+  // (nothing: the key is absent).
+  void expectMetrics(const std::string& name, std::int64_t maxAge, const std::optional<std::string>& lastModified) {
+    EXPECT_EQ(storedMetric(StorebagMetrics::maxAgeKey(name)), std::optional<Value>(Value(maxAge)));
+    const std::optional<Value> stored = storedMetric(StorebagMetrics::lastModifiedKey(name));
+    if (lastModified) {
+      EXPECT_EQ(stored, std::optional<Value>(Value(*lastModified)));
+    } else {
+      EXPECT_FALSE(stored.has_value());
+    }
+  }
+
   // Waits until the helper reports the end of the pull of the name's URL.
   bool waitForPullEnd(const std::string& name) {
     const std::string prefix =
@@ -232,9 +244,7 @@ TEST_F(StorebagRetrievalTest, FirstUseFetchesBlockingSavesAndLaterCallsReadTheDi
   EXPECT_LT(metricsLine, savedLine);
   EXPECT_LT(savedLine, maxAgeLine) << "the caller reads the metrics after the completion";
   EXPECT_EQ(cachedBytes("vantor"), envelope);
-  EXPECT_EQ(storedMetric(StorebagMetrics::maxAgeKey("vantor")), std::optional<Value>(Value(3600)));
-  EXPECT_EQ(storedMetric(StorebagMetrics::lastModifiedKey("vantor")),
-            std::optional<Value>(Value(std::string(kLastModified1))));
+  expectMetrics("vantor", 3600, kLastModified1);
 
   // Later calls read the disk: the server's newer document is not seen, nothing is sent.
   server.serveDocument("vantor", documentWithVersion("2.0"), StorebagHeaders{"max-age=3600", std::nullopt});
@@ -326,9 +336,7 @@ TEST_F(StorebagRetrievalTest, StaleCacheStartsOneConditionalRefreshAndServesTheC
   // The completion saved the new envelope and moved the metrics forward.
   EXPECT_TRUE(capture.contains("fetchStorebagWithName: storebag 'vantor' has been saved to disk cache"));
   EXPECT_EQ(cachedBytes("vantor"), newEnvelope);
-  EXPECT_EQ(storedMetric(StorebagMetrics::maxAgeKey("vantor")), std::optional<Value>(Value(7200)));
-  EXPECT_EQ(storedMetric(StorebagMetrics::lastModifiedKey("vantor")),
-            std::optional<Value>(Value(std::string(kLastModified2))));
+  expectMetrics("vantor", 7200, kLastModified2);
 
   // The next call finds the new file fresh and reads it without another request.
   capture.clear();
@@ -380,9 +388,8 @@ TEST_P(StorebagCacheControlTest, MaxAgeComesFromCacheControl) {
   bool notModified = false;
   expectDocumentOfVersion(retrieval.fetchStorebagWithName("vantor", maxAge, notModified), "1.0");
   EXPECT_EQ(maxAge, param.maxAge);
-  EXPECT_EQ(storedMetric(StorebagMetrics::maxAgeKey("vantor")), std::optional<Value>(Value(param.maxAge)));
   // Without a Last-Modified header the key stays absent.
-  EXPECT_FALSE(storedMetric(StorebagMetrics::lastModifiedKey("vantor")).has_value());
+  expectMetrics("vantor", param.maxAge, std::nullopt);
   EXPECT_TRUE(capture.contains(log::Level::Info, "saveLastLoadedStorebagMetricsWithName: New storebag 'vantor' "
                                                  "received: maxAge " +
                                                      std::to_string(param.maxAge) + ", Last-Modified '(null)'"));
@@ -410,8 +417,7 @@ TEST_F(StorebagRetrievalTest, AnswerWithoutLastModifiedRemovesTheStoredOne) {
   expectDocumentOfVersion(retrieval.fetchStorebagWithName("vantor", maxAge, notModified), "1.0");
   ASSERT_TRUE(waitForPullEnd("vantor"));
   EXPECT_EQ(server.requestsFor("vantor").at(0).header("If-Modified-Since"), kLastModified1);
-  EXPECT_FALSE(storedMetric(StorebagMetrics::lastModifiedKey("vantor")).has_value());
-  EXPECT_EQ(storedMetric(StorebagMetrics::maxAgeKey("vantor")), std::optional<Value>(Value(900)));
+  expectMetrics("vantor", 900, std::nullopt);
   EXPECT_EQ(cachedBytes("vantor"), newEnvelope);
 }
 
@@ -435,9 +441,7 @@ TEST_F(StorebagRetrievalTest, TamperedRefreshIsNotSavedButMovesTheMetrics) {
   EXPECT_EQ(cachedBytes("vantor"), goodEnvelope) << "the previous file stays byte for byte";
   EXPECT_EQ(fileTime(cacheFile("vantor")), modifiedBefore);
   // The metrics of a 200 answer are saved before the signature is checked.
-  EXPECT_EQ(storedMetric(StorebagMetrics::maxAgeKey("vantor")), std::optional<Value>(Value(1200)));
-  EXPECT_EQ(storedMetric(StorebagMetrics::lastModifiedKey("vantor")),
-            std::optional<Value>(Value(std::string(kLastModified2))));
+  expectMetrics("vantor", 1200, kLastModified2);
 }
 
 TEST_F(StorebagRetrievalTest, TamperedEnvelopeOnFirstUseYieldsNothing) {
@@ -611,9 +615,7 @@ TEST_F(StorebagRetrievalTest, NotModifiedRefreshKeepsTheCacheAndTheMetrics) {
   EXPECT_FALSE(capture.containsPrefix("saveLastLoadedStorebagMetricsWithName:"));
   EXPECT_EQ(cachedBytes("vantor"), envelope);
   EXPECT_EQ(fileTime(cacheFile("vantor")), modifiedBefore);
-  EXPECT_EQ(storedMetric(StorebagMetrics::maxAgeKey("vantor")), std::optional<Value>(Value(3600)));
-  EXPECT_EQ(storedMetric(StorebagMetrics::lastModifiedKey("vantor")),
-            std::optional<Value>(Value(std::string(kLastModified1))));
+  expectMetrics("vantor", 3600, kLastModified1);
 }
 
 TEST_F(StorebagRetrievalTest, ServerErrorInRefreshKeepsTheCacheAndTheMetrics) {
@@ -629,9 +631,7 @@ TEST_F(StorebagRetrievalTest, ServerErrorInRefreshKeepsTheCacheAndTheMetrics) {
   // A refresh is not waited for, so its failure is not an error of the call.
   EXPECT_FALSE(capture.containsPrefix("fetchNetworkStorebag: Error resolving"));
   EXPECT_EQ(cachedBytes("vantor"), envelope);
-  EXPECT_EQ(storedMetric(StorebagMetrics::maxAgeKey("vantor")), std::optional<Value>(Value(3600)));
-  EXPECT_EQ(storedMetric(StorebagMetrics::lastModifiedKey("vantor")),
-            std::optional<Value>(Value(std::string(kLastModified1))));
+  expectMetrics("vantor", 3600, kLastModified1);
 }
 
 TEST_F(StorebagRetrievalTest, EmptyRefreshSavesTheMetricsAndKeepsTheCache) {
@@ -647,9 +647,7 @@ TEST_F(StorebagRetrievalTest, EmptyRefreshSavesTheMetricsAndKeepsTheCache) {
                                                              "'vantor") +
                                                      kClosingQuote + ", treat as unchanged"));
   EXPECT_EQ(cachedBytes("vantor"), envelope);
-  EXPECT_EQ(storedMetric(StorebagMetrics::maxAgeKey("vantor")), std::optional<Value>(Value(900)));
-  EXPECT_EQ(storedMetric(StorebagMetrics::lastModifiedKey("vantor")),
-            std::optional<Value>(Value(std::string(kLastModified2))));
+  expectMetrics("vantor", 900, kLastModified2);
 }
 
 TEST_F(StorebagRetrievalTest, EmptyAnswerOnFirstUseSavesTheMetricsButYieldsNothing) {
