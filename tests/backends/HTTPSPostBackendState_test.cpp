@@ -72,7 +72,7 @@ TEST_F(HTTPSPostBackendStateTest, RequiredButEmptyUserInfoIsPending) {
 
 TEST_F(HTTPSPostBackendStateTest, ClientNamesMatchWholeIgnoringCase) {
   EXPECT_EQ(stateFor({with(enablingRule(), {{"client", Value("Other,APP")}})}), kBackendStateEnabled);
-  EXPECT_EQ(stateFor({with(enablingRule(), {{"client", Value("apple")}})}), kBackendStateDisabled);
+  EXPECT_EQ(stateFor({with(enablingRule(), {{"client", Value("application")}})}), kBackendStateDisabled);
   EXPECT_EQ(stateFor({with(enablingRule(), {{"client", Value("ap")}})}), kBackendStateDisabled);
   // Parts are not trimmed.
   EXPECT_EQ(stateFor({with(enablingRule(), {{"client", Value("other, app")}})}), kBackendStateDisabled);

@@ -307,7 +307,7 @@ TEST(PropertyList, XmlWhoseTagsParsersCouldSplitDifferentlyIsRefused) {
   // The usual header, doctype, comments and CDATA are fine.
   auto r = plist::decode(std::string_view(
       "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
-      "<!DOCTYPE plist PUBLIC \"-//Apple//DTD PLIST 1.0//EN\" \"http://www.apple.com/DTDs/PropertyList-1.0.dtd\">\n"
+      "<!DOCTYPE plist PUBLIC \"-//Example//DTD PLIST 1.0//EN\" \"http://www.example.com/DTDs/PropertyList-1.0.dtd\">\n"
       "<!-- a comment -->\n<plist version=\"1.0\"><dict><key>k</key><string><![CDATA[<a>\"]]></string>"
       "<key>q</key><string>it's \"quoted\" &lt;b&gt;</string><key>t</key><true/></dict></plist>\n"));
   ASSERT_TRUE(r.ok()) << r.error();

@@ -133,8 +133,8 @@ TEST(DeviceInfo, TimestampCoarsening) {
 }
 
 TEST(DeviceInfo, ConnectivityClientKey) {
-  Dictionary both{{"_clientName", "FaceTime"}, {"_serviceName", "Calls.Video"}};
-  EXPECT_EQ(connectivityClientKey(Value(both)), "facetime:calls.video");
+  Dictionary both{{"_clientName", "Conferal"}, {"_serviceName", "Calls.Video"}};
+  EXPECT_EQ(connectivityClientKey(Value(both)), "conferal:calls.video");
   EXPECT_EQ(connectivityClientKey(Value(Dictionary{{"_clientName", "Music"}})), "music:");
   EXPECT_EQ(connectivityClientKey(Value(Dictionary{{"_serviceName", "SVC"}})), ":svc");
   EXPECT_EQ(connectivityClientKey(Value(Dictionary{})), ":");

@@ -83,9 +83,9 @@ class MessageLogFileTest : public ::testing::Test {
 TEST_F(MessageLogFileTest, FirstCallWithEmptyFolderCreatesAFileAndWritesOneLine) {
   auto log = makeLog();
   log::LogCapture capture;
-  log->writeToLogFile("[FaceTime -> flushMessages] 3 messages");
+  log->writeToLogFile("[Conferal -> flushMessages] 3 messages");
   EXPECT_EQ(namesIn(logDir_), std::set<std::string>{kStartName});
-  EXPECT_EQ(readFile(logDir_ / kStartName), "(" + kStartDate + ") [FaceTime -> flushMessages] 3 messages\n");
+  EXPECT_EQ(readFile(logDir_ / kStartName), "(" + kStartDate + ") [Conferal -> flushMessages] 3 messages\n");
   std::vector<std::string> expected = {
       "writeToLogFile: Created new telvaned log file " + logPath(kStartName) + " (" + kStartDate + ")",
       "writeToLogFile: Saved log message to " + logPath(kStartName)};
