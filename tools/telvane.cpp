@@ -23,6 +23,7 @@
 // Errors go to standard error as "telvane: ..."; exit status 0 on success, 1 when the
 // daemon refused or did not answer in time, 2 for a malformed command line. The
 // library's own log lines appear on standard error only with --verbose.
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -198,6 +199,18 @@ int sendEvents(Telvane& session, const ToolOptions& options) {
   return kExitOk;
 }
 
+// After a refused upload, names what the daemon refuses that can be seen from here:
+// anything but a regular file (a link is never followed), or an empty one.
+void explainRefusedUpload(const std::string& path) {
+  struct stat attributes {};
+  if (::lstat(path.c_str(), &attributes) != 0) return;
+  if (!S_ISREG(attributes.st_mode)) {
+    std::fprintf(stderr, "telvane: %s: Only upload a regular file.\n", path.c_str());
+  } else if (attributes.st_size == 0) {
+    std::fprintf(stderr, "telvane: %s: Input file is empty\n", path.c_str());
+  }
+}
+
 int uploadFile(Telvane& session, const ToolOptions& options) {
   std::printf("file upload supported: %s\n", session.serverSupportsFileUpload() ? "yes" : "no");
   Pending<bool> uploaded;
@@ -207,6 +220,7 @@ int uploadFile(Telvane& session, const ToolOptions& options) {
   auto outcome = uploaded.wait(options.timeoutSeconds);
   if (!outcome) return fail("no upload reply from the daemon within " + std::to_string(options.timeoutSeconds) + " s");
   std::printf("upload: %s\n", *outcome ? "succeeded" : "failed");
+  if (!*outcome) explainRefusedUpload(options.file);
   return *outcome ? kExitOk : kExitFailure;
 }
 

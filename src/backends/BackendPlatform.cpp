@@ -1,5 +1,6 @@
 #include "backends/BackendPlatform.h"
 
+#include "backends/telemetry/MetrixAdaptorLibrary.h"
 #include "platform/SystemInfo.h"
 
 namespace telvane {
@@ -42,6 +43,8 @@ BackendPlatform BackendPlatform::withSystemDefaults() const {
     bool internal = *resolved.internalRelease;
     resolved.environmentType = [settings, internal] { return environmentTypeFromSettings(*settings, internal); };
   }
+  if (!resolved.powerLog) resolved.powerLog = PowerLog::journal();
+  if (!resolved.metrixAdaptorPath) resolved.metrixAdaptorPath = MetrixAdaptorLibrary::defaultPath();
   return resolved;
 }
 

@@ -4,7 +4,8 @@
 // identifiers, the diagnostics consent), randomness (the sampling draw, new
 // identifiers), the clock (post times), device facts (the model that decides the
 // wireless-diagnostics backend), the internal-release flag, the locale's country code,
-// the time-zone offset and the environment type.
+// the time-zone offset, the environment type, the power log (the power-log backend's
+// sink) and the wireless-diagnostics adaptor object.
 //
 // A default-constructed platform is empty; `withSystemDefaults()` fills every missing
 // piece with the process's real service.
@@ -20,6 +21,7 @@
 #include <string>
 
 #include "platform/Clock.h"
+#include "platform/PowerLog.h"
 #include "platform/Random.h"
 #include "platform/SettingsStore.h"
 #include "util/DeviceInfo.h"
@@ -54,6 +56,11 @@ struct BackendPlatform {
   // 4 release). The daemon passes the storebag's own reading; the default reads the
   // setting without logging.
   std::function<std::uint32_t()> environmentType;
+  // Where the power-log backend records its events; default: the journal.
+  std::shared_ptr<PowerLog> powerLog;
+  // The shared object of the wireless-diagnostics adaptor; unset: $TELVANED_METRIX_ADAPTOR,
+  // else "<libdir>/telvane/metrix-adaptor.so".
+  std::optional<std::string> metrixAdaptorPath;
 
   // A copy with every unset piece replaced by the process's real one.
   BackendPlatform withSystemDefaults() const;

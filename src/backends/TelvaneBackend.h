@@ -69,6 +69,10 @@ struct TimeValue {
 struct FileAccessToken {
   std::optional<Bytes> token;
   int descriptor = -1;
+  // Set by a backend whose server asked for the file's removal when the daemon could
+  // not remove it itself (no right to unlink in the client's folder): the client then
+  // removes it.
+  bool removalLeftToClient = false;
 };
 
 // The exact class of a backend. Some rules apply to the HTTPS post backend itself
@@ -113,7 +117,7 @@ class TelvaneBackend {
   // thread.
   virtual void flushMessagesWithCompletion(FlushCompletion completion) = 0;
   // Uploads a client's file. May block the caller until the upload has finished.
-  virtual bool uploadFileAtPath(const std::string& path, const FileAccessToken& token) = 0;
+  virtual bool uploadFileAtPath(const std::string& path, FileAccessToken& token) = 0;
   virtual bool uploadLogData(const Array& logData) = 0;
   // The memory estimate of the events waiting in batches.
   virtual std::int64_t batchedEventsSize() const = 0;

@@ -87,7 +87,7 @@ void TelvaneBackendBase::flushMessagesWithCompletion(FlushCompletion completion)
   if (completion) completion(std::nullopt, std::nullopt);
 }
 
-bool TelvaneBackendBase::uploadFileAtPath(const std::string& /*path*/, const FileAccessToken& /*token*/) {
+bool TelvaneBackendBase::uploadFileAtPath(const std::string& /*path*/, FileAccessToken& /*token*/) {
   return false;
 }
 

@@ -76,7 +76,7 @@ class TelvaneBackendBase : public TelvaneBackend {
                                          std::uint16_t respCode, std::uint32_t flag) override;
   // The base calls the completion at once with no result and no error.
   void flushMessagesWithCompletion(FlushCompletion completion) override;
-  bool uploadFileAtPath(const std::string& path, const FileAccessToken& token) override;
+  bool uploadFileAtPath(const std::string& path, FileAccessToken& token) override;
   bool uploadLogData(const Array& logData) override;
   std::int64_t batchedEventsSize() const override;
   void setUserInfoDict(const Value& userInfo) override;

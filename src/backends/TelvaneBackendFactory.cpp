@@ -3,6 +3,9 @@
 #include <utility>
 
 #include "backends/https/HTTPSPostBackend.h"
+#include "backends/telemetry/JoulemeterBackend.h"
+#include "backends/telemetry/MetrixBackend.h"
+#include "backends/upload/UploadBackend.h"
 #include "platform/Log.h"
 
 namespace telvane {
@@ -23,12 +26,15 @@ std::optional<BackendKind> backendKindForName(const std::string& name, const std
 
 std::shared_ptr<TelvaneBackendBase> newBackendWithName(const std::string& name, const Value& profile,
                                                        const std::optional<std::string>& productFamily,
-                                                       std::int32_t /*clientType*/, const BackendPlatform& platform) {
+                                                       std::int32_t clientType, const BackendPlatform& platform) {
   BackendPlatform resolved = platform.withSystemDefaults();
   std::optional<BackendKind> kind = backendKindForName(name, resolved.deviceInfo->productType());
   if (kind == BackendKind::HTTPSPost) return HTTPSPostBackend::create(name, profile, productFamily, resolved);
-  // No backend for this name (the dashboard, upload, power-log and wireless-diagnostics
-  // classes are not built yet and end here too).
+  if (kind == BackendKind::Upload) return UploadBackend::create(name, profile, productFamily, resolved);
+  if (kind == BackendKind::Joulemeter) return JoulemeterBackend::create(name, profile, productFamily, resolved);
+  // The only class whose initialiser receives the client type.
+  if (kind == BackendKind::Metrix) return MetrixBackend::create(name, profile, productFamily, clientType, resolved);
+  // No backend for this name (the dashboard class is not built yet and ends here too).
   log::error("TelvaneBackend(newBackendWithName): %s", name);
   return nullptr;
 }

@@ -1,5 +1,7 @@
 // Telvane::Impl: file and log-data uploads, and the digest key.
 #include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -22,6 +24,29 @@ constexpr const char* kUploadBackendName = "upload_server";
 constexpr const char* kFileURLScheme = "file://";
 
 Bytes uploadTokenText() { return Bytes(kUploadTokenClass, kUploadTokenClass + std::strlen(kUploadTokenClass)); }
+
+// The read token: the file opened by us, read-only and never through a symbolic link.
+// Opening does not block (a FIFO would wait for a writer). A symbolic link is handed
+// over as the link itself (a descriptor that grants no reading), so that the daemon
+// sees what it was given and refuses it as not a regular file.
+UniqueFd openForUpload(const std::string& path) {
+  UniqueFd descriptor(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  if (!descriptor && errno == ELOOP) descriptor = UniqueFd(::open(path.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  return descriptor;
+}
+
+// Removes the uploaded file when the daemon says that the server asked for it and it
+// could not do it itself, as long as the path still names the file that was uploaded.
+void removeUploadedFile(const std::string& path, dev_t device, ino_t inode) {
+  struct stat named {};
+  if (::lstat(path.c_str(), &named) != 0 || named.st_dev != device || named.st_ino != inode) return;
+  if (::unlink(path.c_str()) == 0) {
+    log::info("uploadFileWithURL: Removed %s as the upload server asked", path);
+  } else {
+    const int error = errno;
+    log::info("uploadFileWithURL: Failed to remove %s, errno %d", path, error);
+  }
+}
 
 }  // namespace
 
@@ -47,16 +72,18 @@ bool Telvane::Impl::uploadFileWithURL(const std::optional<std::string>& fileURL,
     auto absolute = std::filesystem::absolute(path, error);
     if (!error) path = absolute.string();
   }
-  // The read token: the file opened by us, read-only and never through a symbolic link.
-  UniqueFd token(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+  UniqueFd token = openForUpload(path);
   if (!token) {
     const int error = errno;
     log::info("uploadFileWithURL: Failed to get sandbox extension for path %s, errno %d", path, error);
     return false;
   }
+  struct stat identity {};
+  if (::fstat(token.get(), &identity) != 0) identity = {};
   // std::function wants a copyable closure: the descriptor travels behind a pointer.
   auto descriptor = std::make_shared<UniqueFd>(std::move(token));
-  reportingQueue_->async([self = shared_from_this(), path, descriptor, completion = std::move(completion)] {
+  reportingQueue_->async([self = shared_from_this(), path, descriptor, device = identity.st_dev,
+                          inode = identity.st_ino, completion = std::move(completion)] {
     auto remote = self->connection_->remote();
     if (!remote) {
       log::info("uploadFileWithURL: Failed to get remote object proxy: %s", remote.error());
@@ -67,7 +94,8 @@ bool Telvane::Impl::uploadFileWithURL(const std::optional<std::string>& fileURL,
     descriptors.push_back(std::move(*descriptor));
     self->connection_->call(
         remote.value(), ipc::Operation::UploadFileAtPath, Array{Value(path), Value(uploadTokenText())},
-        [completion](Array reply) {
+        [completion, path, device, inode](Array reply) {
+          if (reply.size() > 1 && reply[1].boolValue()) removeUploadedFile(path, device, inode);
           if (completion) completion(!reply.empty() && reply[0].boolValue());
         },
         [completion] {

@@ -21,7 +21,9 @@ const std::vector<OperationInfo>& table() {
       {Operation::SendMessageWithDictionary, "sendMessageWithDictionary", true, true, {A::Map}, {A::StringOrNil}},
       {Operation::FlushMessages, "flushMessagesWithCompletion", true, true, {}, kTextAndErrorReply},
       {Operation::FinishSessionGracefully, "finishSessionGracefully", true, false, {}, {}},
-      {Operation::UploadFileAtPath, "uploadFileAtPath", true, true, {A::String, A::BytesOrNil}, {A::Bool}, 1},
+      // The reply: whether the upload succeeded, and whether the client should remove the
+      // file (the server asked for it and the daemon could not).
+      {Operation::UploadFileAtPath, "uploadFileAtPath", true, true, {A::String, A::BytesOrNil}, {A::Bool, A::Bool}, 1},
       {Operation::UploadLogData, "uploadLogData", true, true, {A::ListOrNil}, {A::Bool, A::MapOrNil}},
       {Operation::SendMessageWithSessionInfo,
        "sendMessageWithSessionInfo",

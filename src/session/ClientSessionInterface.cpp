@@ -84,7 +84,9 @@ void ClientSessionInterface::dispatch(TelvanedSession& session, IpcConnection::I
       token.descriptor = descriptor.get();
       TelvanedSession::UploadReply reply;
       if (call.reply) {
-        reply = [reply = std::move(call.reply)](bool succeeded) { reply(Array{Value(succeeded)}); };
+        reply = [reply = std::move(call.reply)](bool succeeded, bool removeFile) {
+          reply(Array{Value(succeeded), Value(removeFile)});
+        };
       }
       session.uploadFileAtPath(args[0].stringOrEmpty(), token, std::move(reply));
       break;

@@ -48,7 +48,9 @@ class TelvanedSession : public std::enable_shared_from_this<TelvanedSession> {
                                          std::optional<Array> blacklist)>;
   using TextReply = std::function<void(std::optional<std::string> text)>;
   using FlushReply = std::function<void(std::optional<std::string> result, std::optional<TelvaneError> error)>;
-  using UploadReply = std::function<void(bool succeeded)>;
+  // `removeFile`: the server asked for the file's removal and the daemon could not
+  // remove it itself, so the client should.
+  using UploadReply = std::function<void(bool succeeded, bool removeFile)>;
   using LogDataReply = std::function<void(bool succeeded, std::optional<TelvaneError> error)>;
 
   static constexpr std::uint32_t kDefaultConnectivityHelperReleaseTimeoutSeconds = 30;
@@ -80,7 +82,7 @@ class TelvanedSession : public std::enable_shared_from_this<TelvanedSession> {
   void flushMessagesWithCompletion(FlushReply reply);
   void finishSessionGracefully();
   // The descriptor in the token is borrowed for the call; the caller closes it.
-  void uploadFileAtPath(const std::string& fileURL, const FileAccessToken& token, UploadReply reply);
+  void uploadFileAtPath(const std::string& fileURL, FileAccessToken& token, UploadReply reply);
   void uploadLogData(const Array& logData, LogDataReply reply);
   void sendMessageWithSessionInfo(const Value& sessionInfo, const Value& userInfo, std::uint16_t category,
                                   std::uint16_t type, const Value& payload, TextReply reply);
@@ -106,7 +108,7 @@ class TelvanedSession : public std::enable_shared_from_this<TelvanedSession> {
   void internalFlushMessagesWithCompletion(FlushReply reply);
   void sendOneMessageWithSessionInfo(const Value& sessionInfo, const Value& userInfo, const Value& storebag,
                                      std::uint16_t category, std::uint16_t type, const Value& payload);
-  void uploadFileWithURL(const std::string& fileURL, const FileAccessToken& token, UploadReply reply);
+  void uploadFileWithURL(const std::string& fileURL, FileAccessToken& token, UploadReply reply);
   // The sum over the backends; 0 without backends. Any thread.
   std::int64_t batchedEventsSize() const;
 

@@ -261,14 +261,13 @@ void TelvanedSession::sendOneMessageWithSessionInfo(const Value& sessionInfo, co
   }
 }
 
-void TelvanedSession::uploadFileAtPath(const std::string& fileURL, const FileAccessToken& token, UploadReply reply) {
+void TelvanedSession::uploadFileAtPath(const std::string& fileURL, FileAccessToken& token, UploadReply reply) {
   assertOnQueue(queue_);
   log::info("uploadFileAtPath: Uploading file for session %u", sessionID());
   uploadFileWithURL(fileURL, token, std::move(reply));
 }
 
-void TelvanedSession::uploadFileWithURL(const std::string& fileURL, const FileAccessToken& token,
-                                        UploadReply reply) {
+void TelvanedSession::uploadFileWithURL(const std::string& fileURL, FileAccessToken& token, UploadReply reply) {
   std::string path = pathOfFileURL(fileURL);
   bool succeeded = false;
   if (auto backends = this->backends()) {
@@ -286,7 +285,7 @@ void TelvanedSession::uploadFileWithURL(const std::string& fileURL, const FileAc
     word = "failed";
   }
   writeMessageLog(fmt::sprintf("[uploadFileWithURL] Upload %s for file %s", word, fileURL));
-  if (reply) reply(succeeded);
+  if (reply) reply(succeeded, token.removalLeftToClient);
 }
 
 void TelvanedSession::uploadLogData(const Array& logData, LogDataReply reply) {

@@ -125,7 +125,8 @@ TEST_F(TelvaneBackendBaseTest, BaseOperationsDoNothing) {
   EXPECT_EQ(backend->name(), "plain");
   EXPECT_FALSE(backend->sendMessage(Value(Dictionary{{"a", Value(1)}}), TimeValue{1, 0}, 1, 1, 0).has_value());
   EXPECT_EQ(backend->eventID(), 1);
-  EXPECT_FALSE(backend->uploadFileAtPath("/tmp/x", FileAccessToken{}));
+  FileAccessToken token;
+  EXPECT_FALSE(backend->uploadFileAtPath("/tmp/x", token));
   EXPECT_FALSE(backend->uploadLogData(Array{}));
   EXPECT_EQ(backend->batchedEventsSize(), 0);
   EXPECT_FALSE(backend->displayURL().has_value());  // only the HTTPS backend reads "display_url"

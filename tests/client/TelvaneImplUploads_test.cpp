@@ -2,6 +2,7 @@
 #include "client/TelvaneImpl.h"
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <filesystem>
@@ -63,7 +64,7 @@ TEST_F(TelvaneUploadTest, UploadPassesAReadOnlyDescriptorOfTheFile) {
 TEST_F(TelvaneUploadTest, FileURLIsAcceptedAndTheDaemonsAnswerIsPassedOn) {
   const auto file = dir_ / "crash.txt";
   test::writeFile(file, "x");
-  daemon_.setReply(Op::UploadFileAtPath, Array{Value(false)});
+  daemon_.setReply(Op::UploadFileAtPath, Array{Value(false), Value(false)});
   Awaited<bool> uploaded;
   EXPECT_TRUE(telvane_->uploadFileWithURL("file://" + file.string(), uploaded.setter()));
   EXPECT_EQ(uploaded.wait(), std::optional<bool>(false));
@@ -97,17 +98,75 @@ TEST_F(TelvaneUploadTest, UploadWithoutAReadableFileFails) {
   EXPECT_TRUE(capture.contains("uploadFileWithURL: Failed to get sandbox extension for path " + missing.string() +
                                ", errno 2"));
 
-  // A symbolic link is never followed.
+  telvane_.reset();
+  ASSERT_TRUE(daemon_.waitForDisconnect(0));
+  EXPECT_TRUE(daemon_.calls(Op::UploadFileAtPath).empty());
+}
+
+TEST_F(TelvaneUploadTest, SymbolicLinkIsHandedOverAsTheLinkItselfNeverFollowed) {
   const auto target = dir_ / "target.log";
   const auto link = dir_ / "link.log";
   test::writeFile(target, "secret");
   std::filesystem::create_symlink(target, link);
-  EXPECT_FALSE(telvane_->uploadFileWithURL(link.string()));
-  EXPECT_TRUE(capture.contains("uploadFileWithURL: Failed to get sandbox extension for path " + link.string() +
-                               ", errno 40"));
-  telvane_.reset();
-  ASSERT_TRUE(daemon_.waitForDisconnect(0));
-  EXPECT_TRUE(daemon_.calls(Op::UploadFileAtPath).empty());
+  daemon_.setReply(Op::UploadFileAtPath, Array{Value(false), Value(false)});
+  Awaited<bool> uploaded;
+  EXPECT_TRUE(telvane_->uploadFileWithURL(link.string(), uploaded.setter()));
+  EXPECT_EQ(uploaded.wait(), std::optional<bool>(false));
+  auto uploads = daemon_.calls(Op::UploadFileAtPath);
+  ASSERT_EQ(uploads.size(), 1u);
+  ASSERT_EQ(uploads[0].descriptorFileTypes.size(), 1u);
+  EXPECT_EQ(uploads[0].descriptorFileTypes[0], static_cast<unsigned>(S_IFLNK));
+  // Nothing of the target can be read through it.
+  EXPECT_EQ(uploads[0].descriptorContents[0], "");
+}
+
+TEST_F(TelvaneUploadTest, FifoIsHandedOverWithoutWaitingForAWriter) {
+  const auto fifo = dir_ / "pipe";
+  ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
+  daemon_.setReply(Op::UploadFileAtPath, Array{Value(false), Value(false)});
+  Awaited<bool> uploaded;
+  EXPECT_TRUE(telvane_->uploadFileWithURL(fifo.string(), uploaded.setter()));
+  EXPECT_EQ(uploaded.wait(), std::optional<bool>(false));
+  auto uploads = daemon_.calls(Op::UploadFileAtPath);
+  ASSERT_EQ(uploads.size(), 1u);
+  EXPECT_EQ(uploads[0].descriptorFileTypes, std::vector<unsigned>{static_cast<unsigned>(S_IFIFO)});
+}
+
+TEST_F(TelvaneUploadTest, FileIsRemovedWhenTheDaemonLeavesTheRemovalToTheClient) {
+  log::LogCapture capture;
+  const auto file = dir_ / "accepted.log";
+  test::writeFile(file, "accepted");
+  daemon_.setReply(Op::UploadFileAtPath, Array{Value(true), Value(true)});
+  Awaited<bool> uploaded;
+  EXPECT_TRUE(telvane_->uploadFileWithURL(file.string(), uploaded.setter()));
+  EXPECT_EQ(uploaded.wait(), std::optional<bool>(true));
+  EXPECT_FALSE(std::filesystem::exists(file));
+  EXPECT_TRUE(capture.contains("uploadFileWithURL: Removed " + file.string() + " as the upload server asked"));
+}
+
+TEST_F(TelvaneUploadTest, FileIsKeptUnlessTheDaemonAsksForItsRemoval) {
+  const auto file = dir_ / "kept.log";
+  test::writeFile(file, "kept");
+  daemon_.setReply(Op::UploadFileAtPath, Array{Value(true), Value(false)});
+  Awaited<bool> uploaded;
+  EXPECT_TRUE(telvane_->uploadFileWithURL(file.string(), uploaded.setter()));
+  EXPECT_EQ(uploaded.wait(), std::optional<bool>(true));
+  EXPECT_TRUE(std::filesystem::exists(file));
+}
+
+TEST_F(TelvaneUploadTest, AFileReplacedAfterTheUploadIsNotRemoved) {
+  const auto file = dir_ / "replaced.log";
+  test::writeFile(file, "first");
+  // The daemon's answer comes after the path was given to another file.
+  daemon_.setResponder(Op::UploadFileAtPath, [&](const FakeDaemon::Call&) -> std::optional<Array> {
+    std::filesystem::remove(file);
+    test::writeFile(file, "second");
+    return Array{Value(true), Value(true)};
+  });
+  Awaited<bool> uploaded;
+  EXPECT_TRUE(telvane_->uploadFileWithURL(file.string(), uploaded.setter()));
+  EXPECT_EQ(uploaded.wait(), std::optional<bool>(true));
+  ASSERT_TRUE(std::filesystem::exists(file));
 }
 
 TEST_F(TelvaneUploadTest, EmptyLogDataArrayIsRefused) {

@@ -5,6 +5,8 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
+#include <fstream>
+#include <iterator>
 #include <memory>
 
 #include "e2e/DevServerProcess.h"
@@ -177,4 +179,27 @@ TEST_F(DevServerDemo, TheExampleClientReportsACallAndItsMediaStream) {
   EXPECT_EQ(media[0]["record"]["callID"].stringOrEmpty(), "C-2041");
   EXPECT_EQ(media[0]["record"]["videoCodec"].stringOrEmpty(), "h264");
   EXPECT_EQ(media[0]["record"]["framesDropped"].integerValue(), 3);
+}
+
+TEST_F(DevServerDemo, TheToolsUploadArrivesAndTheFileIsRemovedAfterTheServersSuccess) {
+  const std::filesystem::path file = dir_ / "call log.txt";
+  writeFile(file, "12:00:01 call started\n12:04:09 call ended\n");
+  ToolRun run = telvane({"upload", "--component-type", "7", "--client", "com.example.e2e", "--service", "calls",
+                         "--session-id", "41", "--timeout", "30", file.string()});
+  EXPECT_EQ(run.exitCode, 0) << run.out << run.err << diagnostics();
+  EXPECT_NE(run.out.find("file upload supported: yes\n"), std::string::npos) << run.out;
+  EXPECT_NE(run.out.find("upload: succeeded\n"), std::string::npos) << run.out << diagnostics();
+  EXPECT_FALSE(std::filesystem::exists(file));
+
+  auto uploads = server_->waitForEvents([](const Value& a) { return a["kind"].stringOrEmpty() == "upload"; }, 1,
+                                        kArrivalTimeout);
+  ASSERT_EQ(uploads.size(), 1u) << diagnostics();
+  EXPECT_EQ(uploads[0]["filename"].stringOrEmpty(), "call log.txt.gz");
+  EXPECT_EQ(uploads[0]["sequence"].stringOrEmpty(), "41");
+  EXPECT_EQ(uploads[0]["description"].stringOrEmpty(), "Callwave AFRC log (Uploaded by VTR)");
+  EXPECT_EQ(uploads[0]["query"]["raw"].stringOrEmpty(), "true");
+  EXPECT_TRUE(uploads[0]["gzip"].boolValue());
+  std::ifstream saved(uploads[0]["savedAs"].stringOrEmpty(), std::ios::binary);
+  std::string contents((std::istreambuf_iterator<char>(saved)), std::istreambuf_iterator<char>());
+  EXPECT_EQ(contents, "12:00:01 call started\n12:04:09 call ended\n");
 }

@@ -158,7 +158,7 @@ TEST(IpcConnection, DescriptorTravelsWithTheCall) {
     char buf[64] = {};
     ssize_t n = ::pread(call.descriptors[0].get(), buf, sizeof buf, 0);
     content.set_value(std::string(buf, n > 0 ? static_cast<std::size_t>(n) : 0));
-    call.reply(Array{Value(true)});
+    call.reply(Array{Value(true), Value(false)});
   });
   p.daemon->resume();
   p.client->resume();

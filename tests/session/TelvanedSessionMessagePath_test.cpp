@@ -325,7 +325,7 @@ TEST_F(MessagePathTest, UploadReadsThroughTheClientsDescriptor) {
   fds.emplace_back(::open((dir / "report.log").c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
   auto reply = h.client().call(ipc::Operation::UploadFileAtPath, {Value(url), Value(Bytes{'t', 0})}, std::move(fds));
   ASSERT_TRUE(reply);
-  EXPECT_EQ(*reply, (Array{Value(true)}));
+  EXPECT_EQ(*reply, (Array{Value(true), Value(false)}));
   ASSERT_EQ(a->uploads().size(), 1u);
   EXPECT_EQ(a->uploads()[0].path, (dir / "report.log").string());
   EXPECT_EQ(a->uploads()[0].contents, "file contents");
@@ -339,7 +339,7 @@ TEST_F(MessagePathTest, UploadWithoutBackendsFails) {
   SessionTestHarness h(env);
   auto reply = h.client().call(ipc::Operation::UploadFileAtPath, {Value("/tmp/none%20such"), Value()});
   ASSERT_TRUE(reply);
-  EXPECT_EQ(*reply, (Array{Value(false)}));
+  EXPECT_EQ(*reply, (Array{Value(false), Value(false)}));
   EXPECT_TRUE(capture.contains(log::Level::Error, "uploadFileWithURL: File upload failed for /tmp/none%20such"));
   EXPECT_TRUE(env.messageLog->contains("[uploadFileWithURL] Upload failed for file /tmp/none%20such"));
 }

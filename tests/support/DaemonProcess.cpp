@@ -110,6 +110,10 @@ bool DaemonProcess::spawn() {
   // LISTEN_PID must be the daemon's own pid: a shell sets it to its $$ and then
   // replaces itself with the daemon, which keeps the pid.
   std::string script = options_.socketActivated ? "LISTEN_PID=$$ exec \"$0\"" : "exec \"$0\"";
+  if (options_.runAsUid) {
+    const std::string id = std::to_string(*options_.runAsUid);
+    script = "exec setpriv --reuid=" + id + " --regid=" + id + " --clear-groups \"$0\"";
+  }
   std::vector<std::string> args = {"/bin/sh", "-c", script, binary};
   std::vector<char*> argv;
   for (auto& a : args) argv.push_back(a.data());
@@ -148,6 +152,14 @@ bool DaemonProcess::start() {
     listenSocket_.reset(fd);
     ::unlink(socketPath_.c_str());
     if (::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) < 0 || ::listen(fd, 64) < 0) return false;
+  }
+  if (options_.runAsUid) {
+    namespace fs = std::filesystem;
+    const uid_t id = *options_.runAsUid;
+    if (::chown(directory_.c_str(), id, id) != 0) return false;
+    for (const auto& entry : fs::recursive_directory_iterator(directory_)) {
+      if (::lchown(entry.path().c_str(), id, id) != 0) return false;
+    }
   }
   if (!spawn()) return false;
   if (options_.socketActivated) {

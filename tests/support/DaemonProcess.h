@@ -27,6 +27,9 @@ struct DaemonOptions {
   std::optional<std::vector<std::string>> entitlementLines;
   // Further environment variables for the daemon.
   std::map<std::string, std::string> environment;
+  // Runs the daemon under this user and group id (as the installed service runs under a
+  // dynamic user); the daemon's directory is given to that user. Needs root.
+  std::optional<unsigned> runAsUid;
 };
 
 class DaemonProcess {

@@ -52,6 +52,8 @@ class FakeBackend : public TelvaneBackend {
   }
   void setDeferFlush(bool defer) { locked([&] { deferFlush_ = defer; }); }
   void setUploadResult(bool result) { locked([&] { uploadResult_ = result; }); }
+  // Whether an upload leaves the file's removal to the client.
+  void setUploadLeavesRemovalToClient(bool leave) { locked([&] { uploadLeavesRemoval_ = leave; }); }
   void setLogDataResult(bool result) { locked([&] { logDataResult_ = result; }); }
   void setBatchedSize(std::int64_t size) { locked([&] { batchedSize_ = size; }); }
   void setDisplayURLValue(std::optional<std::string> url) { locked([&] { displayURL_ = std::move(url); }); }
@@ -142,7 +144,7 @@ class FakeBackend : public TelvaneBackend {
     }
     if (completion) completion(result, error);
   }
-  bool uploadFileAtPath(const std::string& path, const FileAccessToken& token) override {
+  bool uploadFileAtPath(const std::string& path, FileAccessToken& token) override {
     std::string contents;
     if (token.descriptor >= 0) {
       char buffer[4096];
@@ -155,6 +157,7 @@ class FakeBackend : public TelvaneBackend {
     }
     std::lock_guard<std::mutex> lock(mutex_);
     uploads_.push_back(Upload{path, token.token, contents});
+    if (uploadLeavesRemoval_) token.removalLeftToClient = true;
     return uploadResult_;
   }
   bool uploadLogData(const Array& logData) override {
@@ -213,6 +216,7 @@ class FakeBackend : public TelvaneBackend {
   bool deferFlush_ = false;
   std::vector<FlushCompletion> deferred_;
   bool uploadResult_ = false;
+  bool uploadLeavesRemoval_ = false;
   bool logDataResult_ = false;
   std::int64_t batchedSize_ = 0;
   std::optional<std::string> displayURL_;

@@ -53,6 +53,11 @@ class FakeConnectivityHelper : public ReportingSessionConnectivityHelper {
   // Completes the index-th POST with a response of the given status (0: no response)
   // and the error, on the calling thread. Each POST is completed at most once.
   void answerPost(std::size_t index, long status, std::optional<TelvaneError> error = std::nullopt) {
+    answerPostWithData(index, status, std::string(), std::move(error));
+  }
+  // The same with the received bytes (none: no data at all).
+  void answerPostWithData(std::size_t index, long status, std::optional<std::string> data,
+                          std::optional<TelvaneError> error = std::nullopt) {
     ConnectivityCompletion completion;
     {
       std::lock_guard<std::mutex> lock(mutex_);
@@ -65,7 +70,7 @@ class FakeConnectivityHelper : public ReportingSessionConnectivityHelper {
       response.emplace();
       response->statusCode = status;
     }
-    completion(std::string(), std::move(response), std::move(error));
+    completion(std::move(data), std::move(response), std::move(error));
   }
 
   std::vector<std::uint32_t> activations() const {

@@ -1,6 +1,7 @@
 #include "support/FakeDaemon.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -19,7 +20,7 @@ std::optional<Array> defaultReply(ipc::Operation operation) {
     case ipc::Operation::FetchDisplayURL: return Array{Value("URL not available")};
     case ipc::Operation::SendMessageWithDictionary: return Array{Value()};
     case ipc::Operation::FlushMessages: return Array{Value(), Value()};
-    case ipc::Operation::UploadFileAtPath: return Array{Value(true)};
+    case ipc::Operation::UploadFileAtPath: return Array{Value(true), Value(false)};
     case ipc::Operation::UploadLogData: return Array{Value(true), Value()};
     case ipc::Operation::SendMessageWithSessionInfo: return Array{Value("finished")};
     default: return std::nullopt;
@@ -108,6 +109,8 @@ void FakeDaemon::handle(std::size_t index, IpcConnection::IncomingCall& call) {
   for (const UniqueFd& fd : call.descriptors) {
     recorded.descriptorContents.push_back(readAll(fd.get()));
     recorded.descriptorReadOnly.push_back((::fcntl(fd.get(), F_GETFL) & O_ACCMODE) == O_RDONLY);
+    struct stat attributes {};
+    recorded.descriptorFileTypes.push_back(::fstat(fd.get(), &attributes) == 0 ? (attributes.st_mode & S_IFMT) : 0u);
   }
   Responder responder;
   {

@@ -40,6 +40,8 @@ class FakeDaemon {
     // for reading only.
     std::vector<std::string> descriptorContents;
     std::vector<bool> descriptorReadOnly;
+    // The file type bits (S_IFMT) of what each descriptor refers to.
+    std::vector<unsigned> descriptorFileTypes;
   };
   // The reply arguments for a call; none to leave the call unanswered.
   using Responder = std::function<std::optional<Array>(const Call&)>;
