@@ -5,7 +5,6 @@
 #pragma once
 
 #include <gtest/gtest.h>
-#include <zlib.h>
 
 #include <atomic>
 #include <map>
@@ -20,33 +19,11 @@
 #include "platform/Json.h"
 #include "platform/Log.h"
 #include "support/FakeConnectivityHelper.h"
+#include "support/Gunzip.h"
 #include "support/ManualClock.h"
 #include "support/ScriptedRandom.h"
 
 namespace telvane::test {
-
-// The bytes of a gzip stream inflated; nothing when they are not one.
-inline std::optional<std::string> gunzip(const std::string& compressed) {
-  z_stream stream{};
-  if (inflateInit2(&stream, 31) != Z_OK) return std::nullopt;
-  std::string out;
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(compressed.data()));
-  stream.avail_in = static_cast<uInt>(compressed.size());
-  char buffer[16384];
-  int rc;
-  do {
-    stream.next_out = reinterpret_cast<Bytef*>(buffer);
-    stream.avail_out = sizeof buffer;
-    rc = inflate(&stream, Z_NO_FLUSH);
-    if (rc != Z_OK && rc != Z_STREAM_END) {
-      inflateEnd(&stream);
-      return std::nullopt;
-    }
-    out.append(buffer, sizeof buffer - stream.avail_out);
-  } while (rc != Z_STREAM_END);
-  inflateEnd(&stream);
-  return out;
-}
 
 inline std::optional<std::string> headerOf(const HttpRequest& request, const std::string& name) {
   for (const auto& [key, value] : request.headers) {

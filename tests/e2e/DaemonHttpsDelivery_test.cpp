@@ -4,7 +4,6 @@
 // the request digest, server errors, the https rewrite and the session's own start and
 // end messages.
 #include <gtest/gtest.h>
-#include <zlib.h>
 
 #include <algorithm>
 #include <cmath>
@@ -16,6 +15,7 @@
 #include "platform/Json.h"
 #include "platform/SqliteSettingsStore.h"
 #include "support/DaemonProcess.h"
+#include "support/Gunzip.h"
 #include "support/SignedEnvelope.h"
 #include "support/StorebagBuilder.h"
 #include "support/TempDir.h"
@@ -35,24 +35,6 @@ namespace {
 constexpr const char* kClient = "com.example.delivery";
 constexpr const char* kOverrideClient = "com.example.override";
 
-std::string gunzip(const std::string& compressed) {
-  z_stream stream{};
-  if (inflateInit2(&stream, 16 + MAX_WBITS) != Z_OK) return {};
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(compressed.data()));
-  stream.avail_in = static_cast<uInt>(compressed.size());
-  std::string out;
-  char buffer[16384];
-  int status = Z_OK;
-  while (status == Z_OK) {
-    stream.next_out = reinterpret_cast<Bytef*>(buffer);
-    stream.avail_out = sizeof buffer;
-    status = inflate(&stream, Z_NO_FLUSH);
-    out.append(buffer, sizeof buffer - stream.avail_out);
-  }
-  inflateEnd(&stream);
-  return status == Z_STREAM_END ? out : std::string();
-}
-
 // One post as the collector understood it.
 struct Post {
   ReceivedRequest request;
@@ -71,8 +53,7 @@ Post decode(const ReceivedRequest& request) {
   // The test server may already have inflated the body; a body that is not gzip
   // stays as it came.
   if (request.header("Content-Encoding") == "gzip") {
-    std::string inflated = gunzip(request.body);
-    if (!inflated.empty()) post.json = std::move(inflated);
+    if (std::optional<std::string> inflated = gunzip(request.body)) post.json = std::move(*inflated);
   }
   auto parsed = json::parse(post.json);
   if (parsed.ok()) post.document = parsed.value();
@@ -129,11 +110,7 @@ class DaemonHttpsDelivery : public ::testing::Test {
       profile.set("clients", Value(std::move(clients)));
       builder.backend(section, backendName_, Value(std::move(profile)));
     }
-    Bytes envelope = SignedEnvelopeBuilder().sign(builder.build());
-    ScriptedAnswer answer;
-    answer.headers = {{"Cache-Control", "max-age=3600"}};
-    answer.body.assign(envelope.begin(), envelope.end());
-    server_.setAnswer("/bags/confera", answer);
+    serveConferaStorebag(server_, builder);
 
     DaemonOptions options;
     options.environment = {{"TELVANED_CA_FILE", TestCertificates::shared().caFile()},
@@ -150,20 +127,14 @@ class DaemonHttpsDelivery : public ::testing::Test {
     if (const Dictionary* extra = extraUserInfo.asDictionary()) {
       for (const auto& [key, value] : *extra) userInfo.set(key, value);
     }
-    auto session = Telvane::create(Value(Dictionary{{kTelvaneSessionInfoClientType, Value(7)},
-                                                    {kTelvaneSessionInfoSessionID, Value(sessionID)},
-                                                    {kTelvaneSessionInfoClientVersion, Value(12)},
-                                                    {kTelvaneSessionInfoBatchEvent, Value(true)},
-                                                    {kTelvaneSessionInfoRequireUserInfo, Value(true)},
-                                                    {kTelvaneSessionInfoHierarchyToken,
-                                                     Telvane::newHierarchyTokenFromParentToken(Value())}}),
-                                   Value(std::move(userInfo)), Value());
-    EXPECT_TRUE(session);
-    std::promise<bool> started;
-    session->startConfigurationWithCompletionHandler([&started](bool received) { started.set_value(received); });
-    auto future = started.get_future();
-    EXPECT_EQ(future.wait_for(20s), std::future_status::ready);
-    sessions_.push_back(std::move(session));
+    sessions_.push_back(startedSession(Value(Dictionary{{kTelvaneSessionInfoClientType, Value(7)},
+                                                        {kTelvaneSessionInfoSessionID, Value(sessionID)},
+                                                        {kTelvaneSessionInfoClientVersion, Value(12)},
+                                                        {kTelvaneSessionInfoBatchEvent, Value(true)},
+                                                        {kTelvaneSessionInfoRequireUserInfo, Value(true)},
+                                                        {kTelvaneSessionInfoHierarchyToken,
+                                                         Telvane::newHierarchyTokenFromParentToken(Value())}}),
+                                       Value(std::move(userInfo))));
     return *sessions_.back();
   }
 

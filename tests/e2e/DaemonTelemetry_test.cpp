@@ -79,11 +79,7 @@ class DaemonTelemetry : public ::testing::Test {
       builder.backend(section, "metrix", Value(Dictionary{{"active", Value(true)}}));
       builder.backend(section, "power", Value::dictionary());
     }
-    Bytes envelope = SignedEnvelopeBuilder().sign(builder.build());
-    ScriptedAnswer answer;
-    answer.headers = {{"Cache-Control", "max-age=3600"}};
-    answer.body.assign(envelope.begin(), envelope.end());
-    server_.setAnswer("/bags/confera", answer);
+    serveConferaStorebag(server_, builder);
 
     DaemonOptions options;
     options.environment = {{"TELVANED_CA_FILE", TestCertificates::shared().caFile()},
@@ -97,19 +93,12 @@ class DaemonTelemetry : public ::testing::Test {
   }
 
   Telvane& open(unsigned sessionID = 1) {
-    auto session = Telvane::create(
+    sessions_.push_back(startedSession(
         Value(Dictionary{{kTelvaneSessionInfoClientType, Value(7)},
                          {kTelvaneSessionInfoSessionID, Value(sessionID)},
                          {kTelvaneSessionInfoClientVersion, Value(12)},
                          {kTelvaneSessionInfoHierarchyToken, Telvane::newHierarchyTokenFromParentToken(Value())}}),
-        Value(Dictionary{{kTelvaneUserInfoClientName, Value(kClient)}, {kTelvaneUserInfoServiceName, Value("calls")}}),
-        Value());
-    EXPECT_TRUE(session);
-    std::promise<bool> started;
-    session->startConfigurationWithCompletionHandler([&started](bool received) { started.set_value(received); });
-    auto future = started.get_future();
-    EXPECT_EQ(future.wait_for(20s), std::future_status::ready);
-    sessions_.push_back(std::move(session));
+        Value(Dictionary{{kTelvaneUserInfoClientName, Value(kClient)}, {kTelvaneUserInfoServiceName, Value("calls")}})));
     return *sessions_.back();
   }
 

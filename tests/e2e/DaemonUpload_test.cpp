@@ -7,7 +7,6 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
-#include <zlib.h>
 
 #include <filesystem>
 #include <fstream>
@@ -17,6 +16,7 @@
 #include "platform/SqliteSettingsStore.h"
 #include "platform/UniqueFd.h"
 #include "support/DaemonProcess.h"
+#include "support/Gunzip.h"
 #include "support/SignedEnvelope.h"
 #include "support/StorebagBuilder.h"
 #include "support/TempDir.h"
@@ -41,27 +41,7 @@ constexpr const char* kDescription = "description=Callwave%20AFRC%20log%20(Uploa
 // The body as the file's bytes. The test server inflates a body sent with
 // "Content-Encoding: gzip" itself (and fails the request when it is not gzip), so a
 // body arrives either still compressed or already inflated by the server.
-std::string gunzip(const std::string& compressed) {
-  if (compressed.size() < 2 || static_cast<unsigned char>(compressed[0]) != 0x1f ||
-      static_cast<unsigned char>(compressed[1]) != 0x8b) {
-    return compressed;
-  }
-  z_stream stream{};
-  if (inflateInit2(&stream, 16 + MAX_WBITS) != Z_OK) return {};
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(compressed.data()));
-  stream.avail_in = static_cast<uInt>(compressed.size());
-  std::string out;
-  char buffer[16384];
-  int status = Z_OK;
-  while (status == Z_OK) {
-    stream.next_out = reinterpret_cast<Bytef*>(buffer);
-    stream.avail_out = sizeof buffer;
-    status = inflate(&stream, Z_NO_FLUSH);
-    out.append(buffer, sizeof buffer - stream.avail_out);
-  }
-  inflateEnd(&stream);
-  return status == Z_STREAM_END ? out : std::string("(not gzip)");
-}
+std::string fileBytesOf(const std::string& body) { return gunzip(body).value_or(body); }
 
 std::string expectedQuery(unsigned sessionID, const std::string& encodedName) {
   return "uuid=" + std::string(kDeviceID) + "&sequence=" + std::to_string(sessionID) + "&" + kDescription +
@@ -106,11 +86,7 @@ class DaemonUpload : public ::testing::Test {
                       Value(Dictionary{{"post_url", Value(postURL.empty() ? server_.url("/upload") : postURL)},
                                        {"display_url", Value("uploads.test")}}));
     }
-    Bytes envelope = SignedEnvelopeBuilder().sign(builder.build());
-    ScriptedAnswer bag;
-    bag.headers = {{"Cache-Control", "max-age=3600"}};
-    bag.body.assign(envelope.begin(), envelope.end());
-    server_.setAnswer("/bags/confera", bag);
+    serveConferaStorebag(server_, builder);
 
     std::ofstream(dir_.path() / "device-info.conf") << "UniqueDeviceID=" << kDeviceID << "\n";
     options.environment["TELVANED_CA_FILE"] = caPath_.string();
@@ -121,18 +97,11 @@ class DaemonUpload : public ::testing::Test {
   }
 
   Telvane& open(unsigned sessionID = kSessionID) {
-    auto session = Telvane::create(Value(Dictionary{{kTelvaneSessionInfoClientType, Value(7)},
-                                                    {kTelvaneSessionInfoSessionID, Value(sessionID)},
-                                                    {kTelvaneSessionInfoClientVersion, Value(3)}}),
-                                   Value(Dictionary{{kTelvaneUserInfoClientName, Value("com.example.conference")},
-                                                    {kTelvaneUserInfoServiceName, Value("calls")}}),
-                                   Value());
-    EXPECT_TRUE(session);
-    std::promise<bool> started;
-    session->startConfigurationWithCompletionHandler([&started](bool received) { started.set_value(received); });
-    auto future = started.get_future();
-    EXPECT_EQ(future.wait_for(20s), std::future_status::ready);
-    sessions_.push_back(std::move(session));
+    sessions_.push_back(startedSession(Value(Dictionary{{kTelvaneSessionInfoClientType, Value(7)},
+                                                        {kTelvaneSessionInfoSessionID, Value(sessionID)},
+                                                        {kTelvaneSessionInfoClientVersion, Value(3)}}),
+                                       Value(Dictionary{{kTelvaneUserInfoClientName, Value("com.example.conference")},
+                                                        {kTelvaneUserInfoServiceName, Value("calls")}})));
     return *sessions_.back();
   }
 
@@ -183,7 +152,7 @@ TEST_F(DaemonUpload, TheFileArrivesCompressedWithTheQueryAndHeadersAndIsRemovedA
   EXPECT_EQ(request.query, expectedQuery(kSessionID, "call%207.log.gz"));
   EXPECT_EQ(request.header("Content-Type"), "application/octet-stream");
   EXPECT_EQ(request.header("Content-Encoding"), "gzip");
-  EXPECT_TRUE(gunzip(request.body) == contents) << "the body does not inflate to the file";
+  EXPECT_TRUE(fileBytesOf(request.body) == contents) << "the body does not inflate to the file";
   EXPECT_FALSE(fs::exists(path));
   EXPECT_TRUE(daemon_->waitForLogLine("UploadBackend(uploadFileAtPath): Uploading file " + path.string()));
   EXPECT_TRUE(daemon_->waitForLogLine("UploadBackend(uploadFileAtPath): sending to |" + server_.url("/upload") + "?" +
@@ -226,7 +195,7 @@ TEST_F(DaemonUpload, TheToolUploadsAndTheFileIsGone) {
   auto requests = server_.requestsForPath("/upload");
   ASSERT_EQ(requests.size(), 1u);
   EXPECT_EQ(requests[0].query, expectedQuery(77, "tool.log.gz"));
-  EXPECT_EQ(gunzip(requests[0].body), "from the tool");
+  EXPECT_EQ(fileBytesOf(requests[0].body), "from the tool");
 }
 
 TEST_F(DaemonUpload, TheToolsUploadsOfADirectoryALinkOrAnEmptyFileAreRefused) {
@@ -300,7 +269,7 @@ TEST_F(DaemonUpload, BadUploadsAreAnsweredAndTheDaemonKeepsServing) {
   auto requests = server_.requestsForPath("/upload");
   ASSERT_EQ(requests.size(), 1u);
   EXPECT_EQ(requests[0].query, expectedQuery(55, "odd%0Aname%FF.log.gz"));
-  EXPECT_EQ(gunzip(requests[0].body), "odd contents");
+  EXPECT_EQ(fileBytesOf(requests[0].body), "odd contents");
   EXPECT_FALSE(fs::exists(odd));
 
   // Another session is served all along.

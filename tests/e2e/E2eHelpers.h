@@ -15,6 +15,10 @@
 #include "platform/IpcConnection.h"
 #include "platform/SerialQueue.h"
 #include "support/DaemonProcess.h"
+#include "support/SignedEnvelope.h"
+#include "support/StorebagBuilder.h"
+#include "support/TlsTestServer.h"
+#include "telvane/Telvane.h"
 #include "telvane/Value.h"
 
 namespace telvane::test {
@@ -59,6 +63,27 @@ inline std::optional<Array> callAndWait(IpcConnection& connection, ipc::Operatio
   connection.call(operation, std::move(arguments), [promise](Array reply) { promise->set_value(std::move(reply)); });
   if (future.wait_for(timeout) != std::future_status::ready) return std::nullopt;
   return future.get();
+}
+
+// Serves the document, signed with the test key, as the storebag of client types 7,
+// 11, 13 and 20 ("<server>/bags/confera"), fresh for an hour.
+inline void serveConferaStorebag(TlsTestServer& server, const StorebagBuilder& document) {
+  Bytes envelope = SignedEnvelopeBuilder().sign(document.build());
+  ScriptedAnswer answer;
+  answer.headers = {{"Cache-Control", "max-age=3600"}};
+  answer.body.assign(envelope.begin(), envelope.end());
+  server.setAnswer("/bags/confera", answer);
+}
+
+// A client session of the client library, started: waits for the daemon's start reply.
+inline std::unique_ptr<Telvane> startedSession(const Value& sessionInfo, const Value& userInfo) {
+  auto session = Telvane::create(sessionInfo, userInfo, Value());
+  EXPECT_TRUE(session);
+  if (!session) return session;
+  auto started = std::make_shared<std::promise<bool>>();
+  session->startConfigurationWithCompletionHandler([started](bool received) { started->set_value(received); });
+  EXPECT_EQ(started->get_future().wait_for(std::chrono::seconds(20)), std::future_status::ready);
+  return session;
 }
 
 inline Value sessionInfoFor(long componentType, unsigned sessionID) {
