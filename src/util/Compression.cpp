@@ -103,4 +103,80 @@ std::optional<Bytes> gzipDeflate(std::string_view data) {
   return gzipDeflate(reinterpret_cast<const std::uint8_t*>(data.data()), data.size());
 }
 
+struct GzipDeflateStream::State {
+  z_stream stream{};
+  bool initialised = false;
+};
+
+GzipDeflateStream::GzipDeflateStream() : state_(std::make_unique<State>()) {
+  const int rc =
+      deflateInit2(&state_->stream, kDeflateLevel, kDeflateMethod, kGzipWindowBits, kMemoryLevel, kStrategy);
+  if (rc != Z_OK) {
+    log::error("compressDataWithZlibOrGzip: deflateInit2() Error: \"%s\" Message: \"%s\"",
+               deflateInitErrorMessage(rc), streamMessage(state_->stream));
+    failed_ = true;
+    return;
+  }
+  state_->initialised = true;
+}
+
+GzipDeflateStream::~GzipDeflateStream() {
+  if (state_->initialised) deflateEnd(&state_->stream);
+}
+
+bool GzipDeflateStream::deflateInto(int flush) {
+  z_stream& stream = state_->stream;
+  constexpr std::size_t kGrowBytes = 64 * 1024;
+  int rc;
+  do {
+    const std::size_t produced = out_.size();
+    out_.resize(produced + kGrowBytes);
+    stream.next_out = reinterpret_cast<Bytef*>(out_.data() + produced);
+    stream.avail_out = static_cast<uInt>(kGrowBytes);
+    rc = deflate(&stream, flush);
+    out_.resize(produced + (kGrowBytes - stream.avail_out));
+    if (rc == Z_STREAM_ERROR) break;
+    // Without finishing, zlib is done with this piece once it leaves output room.
+  } while (flush == Z_FINISH ? rc == Z_OK : stream.avail_out == 0);
+  if ((flush == Z_FINISH && rc != Z_STREAM_END) || rc == Z_STREAM_ERROR) {
+    log::error("compressDataWithZlibOrGzip: zlib error while attempting compression: \"%s\" Message: \"%s\"",
+               deflateErrorMessage(rc), streamMessage(stream));
+    failed_ = true;
+    return false;
+  }
+  return true;
+}
+
+bool GzipDeflateStream::append(const char* data, std::size_t size) {
+  if (failed_) return false;
+  z_stream& stream = state_->stream;
+  while (size > 0) {
+    const uInt piece = static_cast<uInt>(std::min<std::size_t>(size, std::numeric_limits<uInt>::max()));
+    // zlib only reads through next_in; the cast drops const for its C interface.
+    stream.next_in = const_cast<Bytef*>(reinterpret_cast<const Bytef*>(data));
+    stream.avail_in = piece;
+    if (!deflateInto(Z_NO_FLUSH)) return false;
+    data += piece;
+    size -= piece;
+    inputBytes_ += piece;
+  }
+  return true;
+}
+
+std::optional<std::string> GzipDeflateStream::finish() {
+  if (failed_) return std::nullopt;
+  if (inputBytes_ == 0) {
+    log::error("compressDataWithZlibOrGzip: Cannot compress empty ByteData");
+    return std::nullopt;
+  }
+  state_->stream.next_in = nullptr;
+  state_->stream.avail_in = 0;
+  if (!deflateInto(Z_FINISH)) return std::nullopt;
+  out_.shrink_to_fit();
+  log::info("compressDataWithZlibOrGzip: Compressed file from %u to %u", static_cast<std::uint32_t>(inputBytes_),
+            static_cast<std::uint32_t>(out_.size()));
+  failed_ = true;  // finished: nothing more may be appended
+  return std::move(out_);
+}
+
 }  // namespace telvane

@@ -9,7 +9,9 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <memory>
 #include <optional>
+#include <string>
 #include <string_view>
 
 #include "telvane/Value.h"
@@ -26,6 +28,36 @@ inline std::optional<Bytes> compressDataWithZlibOrGzip(bool gzip, const Bytes& d
 std::optional<Bytes> gzipDeflate(const std::uint8_t* data, std::size_t size);
 std::optional<Bytes> gzipDeflate(const Bytes& data);
 std::optional<Bytes> gzipDeflate(std::string_view data);
+
+// A gzip stream made from input that arrives in pieces (a file read in chunks), so that
+// only the compressed output is held, never the whole input. The result is the same
+// stream gzipDeflate makes of the whole input, and it logs the same lines. Not
+// thread-safe; one stream per use.
+class GzipDeflateStream {
+ public:
+  GzipDeflateStream();
+  ~GzipDeflateStream();
+  GzipDeflateStream(const GzipDeflateStream&) = delete;
+  GzipDeflateStream& operator=(const GzipDeflateStream&) = delete;
+
+  // Compresses the next piece. False (logged) when zlib fails; the stream is then
+  // unusable.
+  bool append(const char* data, std::size_t size);
+  // Ends the stream and hands the compressed bytes over. Nothing (logged) when no
+  // byte was appended, or when zlib failed.
+  std::optional<std::string> finish();
+  // Input bytes appended so far.
+  std::uint64_t inputBytes() const { return inputBytes_; }
+
+ private:
+  bool deflateInto(int flush);
+
+  struct State;
+  std::unique_ptr<State> state_;
+  std::string out_;
+  std::uint64_t inputBytes_ = 0;
+  bool failed_ = false;
+};
 
 // The texts logged for zlib's return codes: of deflateInit2(), and of deflate().
 const char* deflateInitErrorMessage(int code);

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 #include <zlib.h>
 
+#include <algorithm>
 #include <random>
 #include <string>
 
@@ -115,6 +116,48 @@ TEST(Compression, PointerOverloadReadsInPlace) {
   auto out = gzipDeflate(data, sizeof data);
   ASSERT_TRUE(out.has_value());
   EXPECT_EQ(inflateAll(*out), Bytes(data, data + sizeof data));
+}
+
+TEST(Compression, StreamInPiecesMakesTheSameGzipAsOnePass) {
+  std::mt19937 random(7);
+  // Text that compresses and random bytes that do not, fed in uneven pieces.
+  std::string text;
+  while (text.size() < 300000) text += "line " + std::to_string(random() % 1000) + " of a log\n";
+  std::string noise(300000, '\0');
+  for (char& c : noise) c = static_cast<char>(random());
+  for (const std::string& input : {text, noise}) {
+    log::LogCapture capture;
+    GzipDeflateStream stream;
+    std::size_t at = 0;
+    while (at < input.size()) {
+      const std::size_t piece = std::min<std::size_t>(input.size() - at, 1 + random() % 70000);
+      ASSERT_TRUE(stream.append(input.data() + at, piece));
+      at += piece;
+    }
+    EXPECT_EQ(stream.inputBytes(), input.size());
+    std::optional<std::string> streamed = stream.finish();
+    ASSERT_TRUE(streamed);
+    std::optional<Bytes> whole = gzipDeflate(input);
+    ASSERT_TRUE(whole);
+    EXPECT_EQ(Bytes(streamed->begin(), streamed->end()), *whole);
+    EXPECT_EQ(inflateAll(*whole), Bytes(input.begin(), input.end()));
+    EXPECT_EQ(capture.count("compressDataWithZlibOrGzip: Compressed file from " + std::to_string(input.size()) +
+                            " to " + std::to_string(streamed->size())),
+              2u);
+  }
+}
+
+TEST(Compression, StreamWithoutInputYieldsNothing) {
+  log::LogCapture capture;
+  GzipDeflateStream stream;
+  EXPECT_TRUE(stream.append("", 0));
+  EXPECT_FALSE(stream.finish().has_value());
+  EXPECT_TRUE(capture.contains(log::Level::Error, "compressDataWithZlibOrGzip: Cannot compress empty ByteData"));
+  // A finished stream takes nothing more.
+  GzipDeflateStream finished;
+  ASSERT_TRUE(finished.append("abc", 3));
+  ASSERT_TRUE(finished.finish().has_value());
+  EXPECT_FALSE(finished.append("d", 1));
 }
 
 TEST(Compression, ErrorMessagesByReturnCode) {

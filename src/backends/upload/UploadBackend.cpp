@@ -122,15 +122,14 @@ std::string UploadBackend::composeUploadURL(const std::string& uploadURL, const 
          "&filename=" + percentEncodeForQuery(lastPathComponent(path) + ".gz") + "&raw=true";
 }
 
-bool UploadBackend::readFile(const std::string& path, int descriptor, std::int64_t expectedSize,
-                             std::string& contents) const {
+UploadBackend::ReadOutcome UploadBackend::readAndCompress(const std::string& path, int descriptor,
+                                                         std::int64_t expectedSize, std::string& compressed) const {
   if (expectedSize > maxUploadFileSize_) {
     log::error("UploadBackend(uploadFileAtPath): File %s of %lld bytes exceeds the maximum upload size of %lld bytes",
                path, static_cast<long long>(expectedSize), static_cast<long long>(maxUploadFileSize_));
-    return false;
+    return ReadOutcome::Refused;
   }
-  contents.clear();
-  contents.reserve(static_cast<std::size_t>(expectedSize));
+  GzipDeflateStream stream;
   std::string chunk(kReadChunkBytes, '\0');
   // Read from the start whatever the descriptor's offset; it is shared with the client.
   off_t offset = 0;
@@ -139,24 +138,27 @@ bool UploadBackend::readFile(const std::string& path, int descriptor, std::int64
     if (n < 0) {
       if (errno == EINTR) continue;
       log::error("UploadBackend(uploadFileAtPath): Unable to read %s: %s", path, errnoText(errno));
-      contents.clear();
-      return true;  // what could not be read counts as empty
+      return ReadOutcome::Empty;  // what could not be read counts as empty
     }
     if (n == 0) break;
-    contents.append(chunk.data(), static_cast<std::size_t>(n));
     offset += n;
-    if (static_cast<std::int64_t>(contents.size()) > maxUploadFileSize_) {
+    if (offset > maxUploadFileSize_) {
       log::error("UploadBackend(uploadFileAtPath): File %s grew beyond the maximum upload size of %lld bytes", path,
                  static_cast<long long>(maxUploadFileSize_));
-      return false;
+      return ReadOutcome::Refused;
     }
+    if (!stream.append(chunk.data(), static_cast<std::size_t>(n))) return ReadOutcome::Refused;
   }
-  if (!contents.empty() && static_cast<std::int64_t>(contents.size()) != expectedSize) {
+  if (offset == 0) return ReadOutcome::Empty;
+  if (offset != expectedSize) {
     log::error("UploadBackend(uploadFileAtPath): File %s changed while it was read (%lld bytes expected, %lld read)",
-               path, static_cast<long long>(expectedSize), static_cast<long long>(contents.size()));
-    return false;
+               path, static_cast<long long>(expectedSize), static_cast<long long>(offset));
+    return ReadOutcome::Refused;
   }
-  return true;
+  std::optional<std::string> finished = stream.finish();
+  if (!finished) return ReadOutcome::Refused;
+  compressed = std::move(*finished);
+  return ReadOutcome::Compressed;
 }
 
 bool UploadBackend::uploadFileAtPath(const std::string& path, FileAccessToken& token) {
@@ -178,15 +180,14 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, FileAccessToken& t
     return false;
   }
 
-  std::string contents;
-  if (!readFile(path, token.descriptor, attributes.st_size, contents)) return false;
-  if (contents.empty()) {
-    log::error("UploadBackend(uploadFileAtPath): Input file is empty");
-    return false;
+  std::string compressed;
+  switch (readAndCompress(path, token.descriptor, attributes.st_size, compressed)) {
+    case ReadOutcome::Compressed: break;
+    case ReadOutcome::Empty:
+      log::error("UploadBackend(uploadFileAtPath): Input file is empty");
+      return false;
+    case ReadOutcome::Refused: return false;
   }
-  std::optional<Bytes> compressed = gzipDeflate(contents);
-  std::string().swap(contents);  // the file's bytes are not needed any more
-  if (!compressed) return false;
 
   HttpRequest request;
   request.method = "POST";
@@ -196,8 +197,7 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, FileAccessToken& t
     return false;
   }
   request.headers = {{"Content-Type", "application/octet-stream"}, {"Content-Encoding", "gzip"}};
-  request.body.assign(compressed->begin(), compressed->end());
-  Bytes().swap(*compressed);
+  request.body = std::move(compressed);
 
   std::shared_ptr<ReportingSessionConnectivityHelper> helper = reportingSessionConnectivityDelegate();
   if (!helper) return true;

@@ -15,8 +15,8 @@
 //
 // Files larger than the maximum upload size (the setting "maxUploadFileSize" of the
 // daemon's settings domain, in bytes; default 16 MiB) are refused before they are read,
-// so that a client cannot make the daemon hold an unbounded file in memory. Reading
-// and compressing need about twice the file's size for a moment.
+// so that a client cannot make the daemon hold an unbounded file in memory. The file is
+// compressed as it is read: the daemon holds the compressed bytes, not the file.
 //
 // `uploadFileAtPath` blocks its caller (the session's queue) until the helper answers.
 // Answers run on the helper's queue, never on the session pool, so blocked sessions
@@ -77,9 +77,13 @@ class UploadBackend : public TelvaneBackendBase {
  private:
   UploadBackend(std::string name, Value profile, std::optional<std::string> productFamily, BackendPlatform platform);
 
-  // Reads the whole file through the descriptor into `contents`. False (logged) when
-  // the file is too large, unreadable or changed its size while it was read.
-  bool readFile(const std::string& path, int descriptor, std::int64_t expectedSize, std::string& contents) const;
+  enum class ReadOutcome { Compressed, Empty, Refused };
+  // Reads the whole file through the descriptor and compresses it as it is read, so
+  // that only the compressed bytes are held. Empty for a file with nothing to read
+  // (also one that could not be read); Refused (logged) when the file is too large or
+  // changed its size while it was read, or compression failed.
+  ReadOutcome readAndCompress(const std::string& path, int descriptor, std::int64_t expectedSize,
+                              std::string& compressed) const;
   // Posts the request and waits for the answer; on a "success" body removes the file.
   void postAndWait(std::shared_ptr<ReportingSessionConnectivityHelper> helper, HttpRequest request,
                    const std::string& path, FileAccessToken& token) const;
