@@ -2,6 +2,7 @@
 
 #include <utility>
 
+#include "backends/dashboard/DashboardBackend.h"
 #include "backends/https/HTTPSPostBackend.h"
 #include "backends/telemetry/JoulemeterBackend.h"
 #include "backends/telemetry/MetrixBackend.h"
@@ -29,12 +30,13 @@ std::shared_ptr<TelvaneBackendBase> newBackendWithName(const std::string& name, 
                                                        std::int32_t clientType, const BackendPlatform& platform) {
   BackendPlatform resolved = platform.withSystemDefaults();
   std::optional<BackendKind> kind = backendKindForName(name, resolved.deviceInfo->productType());
+  if (kind == BackendKind::Dashboard) return DashboardBackend::create(name, profile, productFamily, resolved);
   if (kind == BackendKind::HTTPSPost) return HTTPSPostBackend::create(name, profile, productFamily, resolved);
   if (kind == BackendKind::Upload) return UploadBackend::create(name, profile, productFamily, resolved);
   if (kind == BackendKind::Joulemeter) return JoulemeterBackend::create(name, profile, productFamily, resolved);
   // The only class whose initialiser receives the client type.
   if (kind == BackendKind::Metrix) return MetrixBackend::create(name, profile, productFamily, clientType, resolved);
-  // No backend for this name (the dashboard class is not built yet and ends here too).
+  // No backend for this name.
   log::error("TelvaneBackend(newBackendWithName): %s", name);
   return nullptr;
 }

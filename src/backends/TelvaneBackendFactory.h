@@ -46,8 +46,8 @@ std::optional<BackendKind> backendKindForName(const std::string& name, const std
 // backend (logged as "TelvaneBackend(newBackendWithName): <name>") or when the class's
 // initialiser refuses the profile (logged by the class; the wireless-diagnostics
 // backend refuses client types other than 7, 11 and 13; the upload backend a profile
-// without "post_url"). The power-log backend is always made. The dashboard class is not
-// part of this build yet: its name is logged and yields nothing like an unknown name.
+// without "post_url"; the dashboard backend a profile without a usable "ip" and
+// "port"). The power-log backend is always made.
 std::shared_ptr<TelvaneBackendBase> newBackendWithName(const std::string& name, const Value& profile,
                                                        const std::optional<std::string>& productFamily,
                                                        std::int32_t clientType, const BackendPlatform& platform = {});

@@ -1,5 +1,6 @@
 #include "backends/TelvaneBackendFactory.h"
 #include "backends/upload/UploadBackend.h"
+#include "backends/dashboard/DashboardBackend.h"
 
 #include <gtest/gtest.h>
 
@@ -62,9 +63,22 @@ TEST_F(TelvaneBackendFactoryTest, MetrixOnAMaravelDeviceCreatesNothingAndLogs) {
   EXPECT_TRUE(capture.contains(log::Level::Error, "TelvaneBackend(newBackendWithName): metrix"));
 }
 
-TEST_F(TelvaneBackendFactoryTest, DashboardIsNotMadeYet) {
+TEST_F(TelvaneBackendFactoryTest, DashboardMakesADashboardBackendFromAGoodProfileAndNothingFromABadOne) {
+  auto backend = newBackendWithName(
+      "dashboard",
+      Value(Dictionary{{"ip", Value("127.0.0.1")}, {"port", Value(9)}, {"display_url", Value("dashboard.example")}}),
+      std::string("Laptop"), 7, platform());
+  ASSERT_NE(backend, nullptr);
+  EXPECT_EQ(backend->kind(), BackendKind::Dashboard);
+  EXPECT_NE(dynamic_cast<DashboardBackend*>(backend.get()), nullptr);
+  EXPECT_EQ(backend->name(), "dashboard");
+  EXPECT_EQ(backend->displayURL(), std::optional<std::string>("dashboard.example"));
+  backend->cleanup();
+  // Without an address its initialiser refuses, and the factory adds no line of its own.
+  capture.clear();
   EXPECT_EQ(newBackendWithName("dashboard", Value::dictionary(), std::string("Laptop"), 7, platform()), nullptr);
-  EXPECT_TRUE(capture.contains(log::Level::Error, "TelvaneBackend(newBackendWithName): dashboard"));
+  EXPECT_TRUE(capture.contains(log::Level::Error, "DashboardBackend(initWithName): can't resolve server IP"));
+  EXPECT_FALSE(capture.containsPrefix("TelvaneBackend(newBackendWithName)"));
 }
 
 TEST_F(TelvaneBackendFactoryTest, UploadServerMakesAnUploadBackendWhenItsProfileHasAPostURL) {
@@ -154,7 +168,8 @@ TEST_F(TelvaneBackendFactoryTest, TheEntryFactoryAppliesEverySessionSetting) {
   BackendMap backends = factory(section, sessionInfo, test::userInfo("app", "svc"), "device-7");
 
   ASSERT_EQ(backends.size(), 2u);
-  EXPECT_TRUE(capture.contains(log::Level::Error, "TelvaneBackend(newBackendWithName): dashboard"));
+  // A dashboard entry without an address is refused by its class.
+  EXPECT_TRUE(capture.contains(log::Level::Error, "DashboardBackend(initWithName): can't resolve server IP"));
   EXPECT_TRUE(capture.contains(log::Level::Error, "TelvaneBackend(newBackendWithName): release_timeout"));
   for (const char* name : {"my-splunk-prod", "quarl"}) {
     ASSERT_TRUE(backends.count(name)) << name;
