@@ -13,14 +13,17 @@
 #include <ctime>
 #include <filesystem>
 
+#include "backends/dashboard/DashboardBackend.h"
 #include "e2e/DevServerProcess.h"
 #include "platform/Crypto.h"
 #include "platform/Json.h"
+#include "platform/SettingsStore.h"
 #include "platform/PropertyList.h"
 #include "platform/UniqueFd.h"
 #include "support/TempDir.h"
 #include "support/TestCertificates.h"
 #include "support/ToolRunner.h"
+#include "support/WaitUntil.h"
 #include "util/Compression.h"
 
 using namespace telvane;
@@ -570,6 +573,49 @@ TEST(DevServer, AcknowledgesEachDashboardDatagramWithItsEventIdAndDecodesIt) {
   EXPECT_EQ(first["fields"]["eq"].stringOrEmpty(), "a=b\\c") << "the sender's escapes are undone";
   EXPECT_EQ(first["fields"]["blank"].stringOrEmpty(), "empty");
   EXPECT_EQ(datagrams[2]["fields"]["a"].stringOrEmpty(), "2");
+  EXPECT_EQ(server.stop(), 0);
+}
+
+TEST(DevServer, DecodesAndAcknowledgesTheDashboardBackendsOwnDatagram) {
+  TempDir dir;
+  DevServerProcess server(dir.str());
+  ASSERT_TRUE(server.start()) << server.errors();
+  BackendPlatform platform;
+  platform.settings = makeMemorySettingsStore();
+  auto backend = DashboardBackend::create(
+      "dashboard",
+      Value(Dictionary{{"ip", Value("127.0.0.1")}, {"port", Value(server.udpPort())}, {"reliable", Value(200)}}),
+      std::string("Laptop"), platform);
+  ASSERT_NE(backend, nullptr);
+  backend->setSelfVersion("8.1.2");
+  backend->setCompType(7);
+  backend->setSessionID(41);
+  backend->setClientVersion(3);
+  backend->setUdid(std::string(40, 'b'));
+  const Value event(Dictionary{{"note", Value("hello world")}, {"eq", Value("a=b\\c")}, {"n", Value(5)}});
+  backend->sendMessage(event, TimeValue{12, 345678}, 12, 1, static_cast<std::uint16_t>(300));
+
+  auto datagrams = server.waitForEvents([](const Value& a) { return isKind(a, "datagram"); }, 1);
+  ASSERT_EQ(datagrams.size(), 1u);
+  const Value& d = datagrams[0];
+  EXPECT_EQ(d["sessionID"].integerValue(), 41);
+  EXPECT_EQ(d["clientVersion"].integerValue(), 3);
+  EXPECT_EQ(d["declaredLength"].integerValue(), d["bytes"].integerValue());
+  EXPECT_EQ(d["category"].integerValue(), 12);
+  EXPECT_EQ(d["type"].integerValue(), 1);
+  EXPECT_EQ(d["eventID"].integerValue(), 300);
+  EXPECT_EQ(d["componentType"].integerValue(), 7);
+  EXPECT_EQ(d["majorVersion"].integerValue(), 8);
+  EXPECT_DOUBLE_EQ(d["timestamp"].doubleValue(), 12.344);
+  EXPECT_EQ(d["deviceID"].stringOrEmpty(), std::string(40, 'b'));
+  EXPECT_TRUE(d["reliable"].boolValue());
+  EXPECT_TRUE(d["addressFromProfile"].boolValue());
+  EXPECT_EQ(d["fields"]["note"].stringOrEmpty(), "hello world");
+  EXPECT_EQ(d["fields"]["eq"].stringOrEmpty(), "a=b\\c");
+  EXPECT_EQ(d["fields"]["n"].stringOrEmpty(), "5");
+  // The server's acknowledgement takes the packet out of the backend's queue.
+  EXPECT_TRUE(waitUntil([&] { return backend->messageQueueSnapshot().empty(); }, std::chrono::seconds(10)));
+  backend->cleanup();
   EXPECT_EQ(server.stop(), 0);
 }
 
