@@ -1,5 +1,6 @@
 #include "backends/TelvaneBackendBase.h"
 
+#include <future>
 #include <utility>
 
 #include "util/PersistentIdentifiers.h"
@@ -387,6 +388,19 @@ double TelvaneBackendBase::startTimeStamp() const {
 bool TelvaneBackendBase::shouldUseWiFiOnly() const {
   std::lock_guard<std::mutex> lock(settingsMutex_);
   return shouldUseWiFiOnly_;
+}
+
+std::optional<TelvaneBackendBase::PostAnswer> TelvaneBackendBase::postAndWait(
+    ReportingSessionConnectivityHelper& helper, HttpRequest request, std::chrono::milliseconds limit) {
+  auto promise = std::make_shared<std::promise<PostAnswer>>();
+  std::future<PostAnswer> future = promise->get_future();
+  helper.postURLRequestWithCompletionHandler(
+      std::move(request), [promise](std::optional<std::string> data, std::optional<HttpResponse> /*response*/,
+                                    std::optional<TelvaneError> error) {
+        promise->set_value(PostAnswer{std::move(data), std::move(error)});
+      });
+  if (future.wait_for(limit) != std::future_status::ready) return std::nullopt;
+  return future.get();
 }
 
 }  // namespace telvane

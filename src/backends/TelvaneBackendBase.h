@@ -24,6 +24,7 @@
 #pragma once
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -150,6 +151,18 @@ class TelvaneBackendBase : public TelvaneBackend {
   const std::shared_ptr<SerialQueue>& stateQueue() const { return stateQueue_; }
 
  protected:
+  // What a POST came back with from the connectivity helper.
+  struct PostAnswer {
+    std::optional<std::string> data;
+    std::optional<TelvaneError> error;
+  };
+  // Hands the request to the helper and blocks the caller until its completion has run
+  // (on the helper's queue). Nothing when no answer came within the limit: a helper
+  // that is inactive or in another mode never answers, and an unbounded wait would
+  // block the caller's queue for good.
+  static std::optional<PostAnswer> postAndWait(ReportingSessionConnectivityHelper& helper, HttpRequest request,
+                                               std::chrono::milliseconds limit);
+
   // The state and whatever else a backend keeps on its state queue. Shared with the
   // work queued there, so that work queued asynchronously outlives the backend safely.
   struct QueueState {

@@ -1,5 +1,4 @@
 // DashboardBackend: upload of archived log-data arrays.
-#include <future>
 #include <utility>
 
 #include "backends/dashboard/DashboardBackend.h"
@@ -29,37 +28,24 @@ bool DashboardBackend::uploadLogData(const Array& logData) {
   std::shared_ptr<ReportingSessionConnectivityHelper> helper = reportingSessionConnectivityDelegate();
   if (!helper) return true;
 
-  struct Answer {
-    std::optional<std::string> data;
-    std::optional<TelvaneError> error;
-  };
-  auto promise = std::make_shared<std::promise<Answer>>();
-  std::future<Answer> future = promise->get_future();
-  helper->postURLRequestWithCompletionHandler(
-      std::move(request), [promise](std::optional<std::string> data, std::optional<HttpResponse> /*response*/,
-                                    std::optional<TelvaneError> error) {
-        promise->set_value(Answer{std::move(data), std::move(error)});
-      });
+  std::optional<PostAnswer> answer = postAndWait(*helper, std::move(request), uploadAnswerWaitLimit_);
   std::string problem;
-  if (future.wait_for(uploadAnswerWaitLimit_) != std::future_status::ready) {
+  if (!answer) {
     problem = "no answer within " + std::to_string(uploadAnswerWaitLimit_.count()) + " ms";
+  } else if (answer->error) {
+    problem = answer->error->description;
+  } else if (!answer->data || answer->data->empty()) {
+    problem = "no response data";
+  } else if (!json::isValidUtf8(*answer->data)) {
+    problem = "response data is not UTF-8 text";
   } else {
-    Answer answer = future.get();
-    if (answer.error) {
-      problem = answer.error->description;
-    } else if (!answer.data || answer.data->empty()) {
-      problem = "no response data";
-    } else if (!json::isValidUtf8(*answer.data)) {
-      problem = "response data is not UTF-8 text";
-    } else {
-      const std::string location = std::move(*answer.data);
-      log::info("DashboardBackend(uploadLogData): Log data uploaded to %s", location);
-      // Through the base's five-argument send: it counts the event and hands it to the
-      // six-argument send, which this class leaves to the base, so no datagram is made.
-      TelvaneBackendBase::sendMessage(Value(Dictionary{{kLogDataUploadLocationKey, Value(location)}}),
-                                      TimeValue::fromSeconds(platform_.clock->now()), 0, 2, kMessageFlagOrdinary);
-      return true;
-    }
+    const std::string location = std::move(*answer->data);
+    log::info("DashboardBackend(uploadLogData): Log data uploaded to %s", location);
+    // Through the base's five-argument send: it counts the event and hands it to the
+    // six-argument send, which this class leaves to the base, so no datagram is made.
+    TelvaneBackendBase::sendMessage(Value(Dictionary{{kLogDataUploadLocationKey, Value(location)}}),
+                                    TimeValue::fromSeconds(platform_.clock->now()), 0, 2, kMessageFlagOrdinary);
+    return true;
   }
   log::error("DashboardBackend(uploadLogData): Error uploading log data array (%s)", problem);
   return false;

@@ -7,7 +7,6 @@
 
 #include <cerrno>
 #include <cstring>
-#include <future>
 #include <utility>
 
 #include "platform/Json.h"
@@ -201,38 +200,27 @@ bool UploadBackend::uploadFileAtPath(const std::string& path, FileAccessToken& t
 
   std::shared_ptr<ReportingSessionConnectivityHelper> helper = reportingSessionConnectivityDelegate();
   if (!helper) return true;
-  postAndWait(std::move(helper), std::move(request), path, token);
+  postAndRemoveOnSuccess(*helper, std::move(request), path, token);
   // Once posted, the upload counts as done whatever came back.
   return true;
 }
 
-void UploadBackend::postAndWait(std::shared_ptr<ReportingSessionConnectivityHelper> helper, HttpRequest request,
-                                const std::string& path, FileAccessToken& token) const {
-  struct Answer {
-    std::optional<std::string> data;
-    std::optional<TelvaneError> error;
-  };
-  auto promise = std::make_shared<std::promise<Answer>>();
-  std::future<Answer> future = promise->get_future();
+void UploadBackend::postAndRemoveOnSuccess(ReportingSessionConnectivityHelper& helper, HttpRequest request,
+                                           const std::string& path, FileAccessToken& token) const {
   const std::string url = request.url;
-  helper->postURLRequestWithCompletionHandler(
-      std::move(request), [promise](std::optional<std::string> data, std::optional<HttpResponse> /*response*/,
-                                    std::optional<TelvaneError> error) {
-        promise->set_value(Answer{std::move(data), std::move(error)});
-      });
-  if (future.wait_for(kUploadAnswerWaitLimit) != std::future_status::ready) {
+  std::optional<PostAnswer> answer = postAndWait(helper, std::move(request), kUploadAnswerWaitLimit);
+  if (!answer) {
     log::error("UploadBackend(uploadFileAtPath): post %s",
                "no answer within " + std::to_string(kUploadAnswerWaitLimit.count()) + " seconds");
     return;
   }
-  Answer answer = future.get();
-  if (answer.error) {
-    log::error("UploadBackend(uploadFileAtPath): post %s", answer.error->description);
+  if (answer->error) {
+    log::error("UploadBackend(uploadFileAtPath): post %s", answer->error->description);
     return;
   }
   // A body that is not UTF-8 text reads as no text at all.
   std::optional<std::string> text;
-  if (answer.data && json::isValidUtf8(*answer.data)) text = std::move(answer.data);
+  if (answer->data && json::isValidUtf8(*answer->data)) text = std::move(answer->data);
   log::info("UploadBackend(uploadFileAtPath): sending to |%s|, Json output: %s", url, text ? *text : "(null)");
   if (text && text->find(kSuccessWord) != std::string::npos) removeUploadedFile(path, token);
 }

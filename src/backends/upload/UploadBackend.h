@@ -85,8 +85,8 @@ class UploadBackend : public TelvaneBackendBase {
   ReadOutcome readAndCompress(const std::string& path, int descriptor, std::int64_t expectedSize,
                               std::string& compressed) const;
   // Posts the request and waits for the answer; on a "success" body removes the file.
-  void postAndWait(std::shared_ptr<ReportingSessionConnectivityHelper> helper, HttpRequest request,
-                   const std::string& path, FileAccessToken& token) const;
+  void postAndRemoveOnSuccess(ReportingSessionConnectivityHelper& helper, HttpRequest request,
+                              const std::string& path, FileAccessToken& token) const;
 
   std::int64_t maxUploadFileSize_ = kDefaultMaxUploadFileSize;
   // Guarded by settingsMutex_.
