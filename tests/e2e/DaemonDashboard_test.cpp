@@ -10,17 +10,10 @@
 #include <fstream>
 #include <future>
 
-#include "e2e/E2eHelpers.h"
+#include "e2e/StorebagDaemonTest.h"
 #include "platform/PropertyList.h"
-#include "platform/SqliteSettingsStore.h"
-#include "support/DaemonProcess.h"
-#include "support/StorebagBuilder.h"
-#include "support/TempDir.h"
-#include "support/TestCertificates.h"
-#include "support/TlsTestServer.h"
 #include "support/UdpTestCollector.h"
 #include "support/WaitUntil.h"
-#include "telvane/Telvane.h"
 #include "telvane/TelvaneKeys.h"
 
 using namespace telvane;
@@ -30,34 +23,9 @@ namespace fs = std::filesystem;
 
 namespace {
 
-constexpr const char* kDeviceID = "0123456789abcdef0123456789abcdef01234567";
-
-class DaemonDashboard : public ::testing::Test {
+class DaemonDashboard : public StorebagDaemonTest {
  protected:
-  void SetUp() override {
-    keyPath_ = dir_.path() / "storebag-key.der";
-    TestKeyPair::shared().writePublicKey(keyPath_);
-    caPath_ = dir_.path() / "ca.pem";
-    fs::copy_file(TestCertificates::shared().caFile(), caPath_);
-    settings_ = SqliteSettingsStore::open(dir_.str() + "/defaults.sqlite3");
-    ASSERT_TRUE(settings_);
-    ASSERT_TRUE(settings_->write("com.zembra.telvane", "telvane_storebag_url", Value(server_.url("/bags"))));
-  }
-
-  void TearDown() override {
-    sessions_.clear();
-    if (daemon_) {
-      EXPECT_EQ(daemon_->stop(), 0) << daemon_->log();
-    }
-  }
-
-  void answer(const std::string& body, int status = 200) {
-    ScriptedAnswer reply;
-    reply.status = status;
-    reply.body = body;
-    reply.contentType = "text/plain";
-    server_.setAnswer("/logdata", reply);
-  }
+  void answer(const std::string& body, int status = 200) { answerPath("/logdata", body, status); }
 
   void startDaemon() {
     StorebagBuilder builder;
@@ -70,23 +38,7 @@ class DaemonDashboard : public ::testing::Test {
                                        {"post_url", Value(server_.url("/logdata"))},
                                        {"display_url", Value("dashboard.test")}}));
     }
-    serveConferaStorebag(server_, builder);
-    std::ofstream(dir_.path() / "device-info.conf") << "UniqueDeviceID=" << kDeviceID << "\n";
-    DaemonOptions options;
-    options.environment["TELVANED_CA_FILE"] = caPath_.string();
-    options.environment["TELVANED_PUBLIC_KEY"] = keyPath_.string();
-    daemon_ = std::make_unique<DaemonProcess>(dir_.str(), options);
-    ASSERT_TRUE(daemon_->start());
-    useDaemon(*daemon_);
-  }
-
-  Telvane& open() {
-    sessions_.push_back(startedSession(Value(Dictionary{{kTelvaneSessionInfoClientType, Value(7)},
-                                                        {kTelvaneSessionInfoSessionID, Value(2718u)},
-                                                        {kTelvaneSessionInfoClientVersion, Value(3)}}),
-                                       Value(Dictionary{{kTelvaneUserInfoClientName, Value("com.example.conference")},
-                                                        {kTelvaneUserInfoServiceName, Value("calls")}})));
-    return *sessions_.back();
+    startDaemonWith(builder);
   }
 
   static Value logData() {
@@ -105,20 +57,13 @@ class DaemonDashboard : public ::testing::Test {
     return future.get();
   }
 
-  TempDir dir_;
-  TlsTestServer server_;
   UdpTestCollector collector_{UdpTestCollector::Mode::Acknowledge};
-  fs::path keyPath_;
-  fs::path caPath_;
-  std::shared_ptr<SqliteSettingsStore> settings_;
-  std::unique_ptr<DaemonProcess> daemon_;
-  std::vector<std::unique_ptr<Telvane>> sessions_;
 };
 
 TEST_F(DaemonDashboard, LogDataArrivesAsABinaryPropertyListAndTheLocationIsLogged) {
   answer("https://dashboard.test/logs/42");
   startDaemon();
-  Telvane& session = open();
+  Telvane& session = open(2718);
   EXPECT_EQ(session.enabledBackendNames(), std::vector<std::string>{"dashboard"});
   EXPECT_EQ(upload(session), std::optional<bool>(true)) << daemon_->log();
 
@@ -136,7 +81,7 @@ TEST_F(DaemonDashboard, LogDataArrivesAsABinaryPropertyListAndTheLocationIsLogge
 TEST_F(DaemonDashboard, AnAnswerWithoutBodyFailsTheUpload) {
   answer("", 500);
   startDaemon();
-  Telvane& session = open();
+  Telvane& session = open(2718);
   EXPECT_EQ(upload(session), std::optional<bool>(false)) << daemon_->log();
   EXPECT_TRUE(daemon_->waitForLogLine("DashboardBackend(uploadLogData): Error uploading log data array (no response data)"));
   EXPECT_TRUE(daemon_->waitForLogLine("uploadLogData: Log data array upload failed"));
@@ -145,7 +90,7 @@ TEST_F(DaemonDashboard, AnAnswerWithoutBodyFailsTheUpload) {
 TEST_F(DaemonDashboard, SessionEventsAreNotSentAsDatagrams) {
   answer("https://dashboard.test/logs/1");
   startDaemon();
-  Telvane& session = open();
+  Telvane& session = open(2718);
   EXPECT_TRUE(session.sendMessageWithCategory(1, 2, Value(Dictionary{{"k", Value("v")}})));
   // The upload's location event goes through the same path; neither makes a datagram.
   EXPECT_EQ(upload(session), std::optional<bool>(true)) << daemon_->log();

@@ -12,20 +12,12 @@
 #include <fstream>
 #include <future>
 
-#include "e2e/E2eHelpers.h"
-#include "platform/SqliteSettingsStore.h"
+#include "e2e/StorebagDaemonTest.h"
 #include "platform/UniqueFd.h"
-#include "support/DaemonProcess.h"
 #include "support/Gunzip.h"
-#include "support/SignedEnvelope.h"
-#include "support/StorebagBuilder.h"
 #include "support/TempDir.h"
-#include "support/TestCertificates.h"
-#include "support/TlsTestServer.h"
 #include "support/ToolRunner.h"
 #include "support/WaitUntil.h"
-#include "telvane/Telvane.h"
-#include "telvane/TelvaneKeys.h"
 
 using namespace telvane;
 using namespace telvane::test;
@@ -34,7 +26,6 @@ namespace fs = std::filesystem;
 
 namespace {
 
-constexpr const char* kDeviceID = "0123456789abcdef0123456789abcdef01234567";
 constexpr unsigned kSessionID = 3141;
 constexpr const char* kDescription = "description=Callwave%20AFRC%20log%20(Uploaded%20by%20VTR)";
 
@@ -44,39 +35,19 @@ constexpr const char* kDescription = "description=Callwave%20AFRC%20log%20(Uploa
 std::string fileBytesOf(const std::string& body) { return gunzip(body).value_or(body); }
 
 std::string expectedQuery(unsigned sessionID, const std::string& encodedName) {
-  return "uuid=" + std::string(kDeviceID) + "&sequence=" + std::to_string(sessionID) + "&" + kDescription +
+  return "uuid=" + std::string(StorebagDaemonTest::kDeviceID) + "&sequence=" + std::to_string(sessionID) + "&" + kDescription +
          "&filename=" + encodedName + "&raw=true";
 }
 
-class DaemonUpload : public ::testing::Test {
+class DaemonUpload : public StorebagDaemonTest {
  protected:
   void SetUp() override {
-    keyPath_ = dir_.path() / "storebag-key.der";
-    TestKeyPair::shared().writePublicKey(keyPath_);
-    // The daemon may run as another user: it gets its own copy of the CA.
-    caPath_ = dir_.path() / "ca.pem";
-    fs::copy_file(TestCertificates::shared().caFile(), caPath_);
-    settings_ = SqliteSettingsStore::open(dir_.str() + "/defaults.sqlite3");
-    ASSERT_TRUE(settings_);
-    ASSERT_TRUE(settings_->write("com.zembra.telvane", "telvane_storebag_url", Value(server_.url("/bags"))));
+    StorebagDaemonTest::SetUp();
     answer("success");
     files_ = std::make_unique<TempDir>();
   }
 
-  void TearDown() override {
-    sessions_.clear();
-    if (daemon_) {
-      EXPECT_EQ(daemon_->stop(), 0) << daemon_->log();
-    }
-  }
-
-  void answer(const std::string& body, int status = 200) {
-    ScriptedAnswer reply;
-    reply.status = status;
-    reply.body = body;
-    reply.contentType = "text/plain";
-    server_.setAnswer("/upload", reply);
-  }
+  void answer(const std::string& body, int status = 200) { answerPath("/upload", body, status); }
 
   void startDaemon(const std::string& postURL = "", DaemonOptions options = {}) {
     StorebagBuilder builder;
@@ -86,24 +57,10 @@ class DaemonUpload : public ::testing::Test {
                       Value(Dictionary{{"post_url", Value(postURL.empty() ? server_.url("/upload") : postURL)},
                                        {"display_url", Value("uploads.test")}}));
     }
-    serveConferaStorebag(server_, builder);
-
-    std::ofstream(dir_.path() / "device-info.conf") << "UniqueDeviceID=" << kDeviceID << "\n";
-    options.environment["TELVANED_CA_FILE"] = caPath_.string();
-    options.environment["TELVANED_PUBLIC_KEY"] = keyPath_.string();
-    daemon_ = std::make_unique<DaemonProcess>(dir_.str(), options);
-    ASSERT_TRUE(daemon_->start());
-    useDaemon(*daemon_);
+    startDaemonWith(builder, std::move(options));
   }
 
-  Telvane& open(unsigned sessionID = kSessionID) {
-    sessions_.push_back(startedSession(Value(Dictionary{{kTelvaneSessionInfoClientType, Value(7)},
-                                                        {kTelvaneSessionInfoSessionID, Value(sessionID)},
-                                                        {kTelvaneSessionInfoClientVersion, Value(3)}}),
-                                       Value(Dictionary{{kTelvaneUserInfoClientName, Value("com.example.conference")},
-                                                        {kTelvaneUserInfoServiceName, Value("calls")}})));
-    return *sessions_.back();
-  }
+  Telvane& open(unsigned sessionID = kSessionID) { return StorebagDaemonTest::open(sessionID); }
 
   // Uploads through the library and waits for the daemon's answer.
   std::optional<bool> upload(Telvane& session, const fs::path& path) {
@@ -127,14 +84,7 @@ class DaemonUpload : public ::testing::Test {
     return runTool(builtToolPath("telvane"), all, {"TELVANED_SOCKET=" + daemon_->socketPath()});
   }
 
-  TempDir dir_;
   std::unique_ptr<TempDir> files_;
-  TlsTestServer server_;
-  fs::path keyPath_;
-  fs::path caPath_;
-  std::shared_ptr<SqliteSettingsStore> settings_;
-  std::unique_ptr<DaemonProcess> daemon_;
-  std::vector<std::unique_ptr<Telvane>> sessions_;
 };
 
 TEST_F(DaemonUpload, TheFileArrivesCompressedWithTheQueryAndHeadersAndIsRemovedAfterSuccess) {
