@@ -24,6 +24,7 @@
 #include "platform/IpcListener.h"
 #include "platform/KeepAlive.h"
 #include "platform/Log.h"
+#include "platform/LogOutput.h"
 #include "platform/Paths.h"
 #include "platform/SerialQueue.h"
 #include "platform/SystemInfo.h"
@@ -78,6 +79,7 @@ int main(int argc, char** argv) {
   pthread_sigmask(SIG_BLOCK, &signals, nullptr);
   ::signal(SIGPIPE, SIG_IGN);
 
+  log::useSpdlog();
   setUtilityQualityOfService();
   log::info("startLogging: Daemon starts logging...");
   ReportingSessionConnectivityHelper::cleanupStorageRootFolder();

@@ -1,4 +1,4 @@
-// Digests, HMAC, RSA signature verification and base64, over OpenSSL.
+// Digests, HMAC and RSA signature verification over OpenSSL; base64 (Base64.h).
 // All functions are pure and thread-safe.
 #pragma once
 
@@ -6,6 +6,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/Base64.h"
 #include "platform/Result.h"
 #include "telvane/Value.h"
 
@@ -39,11 +40,5 @@ class PublicKey {
   void* key_ = nullptr;  // EVP_PKEY*
 };
 
-std::string base64Encode(const std::uint8_t* data, std::size_t size);
-inline std::string base64Encode(const Bytes& b) { return base64Encode(b.data(), b.size()); }
-// Decodes base64, ignoring every character outside the alphabet (line breaks, blanks,
-// junk). Fails only when the remaining characters cannot form base64 (a dangling
-// single character).
-Result<Bytes> base64Decode(std::string_view text);
 
 }  // namespace telvane::crypto

@@ -16,7 +16,7 @@
 #include <memory>
 #include <vector>
 
-#include "platform/Crypto.h"
+#include "platform/Base64.h"
 
 namespace telvane::json {
 

@@ -1,16 +1,16 @@
 #include "platform/Log.h"
 
-#include <spdlog/sinks/stdout_sinks.h>
-#include <spdlog/sinks/systemd_sink.h>
-#include <spdlog/spdlog.h>
+#include <sys/syscall.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
+#include <chrono>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <ctime>
 #include <string>
-
-#include <unistd.h>
 
 namespace telvane::log {
 
@@ -24,25 +24,18 @@ Level levelFromEnvironment() {
   return Level::Info;
 }
 
-std::shared_ptr<spdlog::logger> makeLogger(bool journal) {
-  std::shared_ptr<spdlog::sinks::sink> sink;
-  if (journal) {
-    sink = std::make_shared<spdlog::sinks::systemd_sink_mt>("", false);
-  } else {
-    sink = std::make_shared<spdlog::sinks::stderr_sink_mt>();
-    // The process id is written into the pattern once: "%P" would ask the kernel for
-    // it on every line.
-    sink->set_pattern("%Y-%m-%d %H:%M:%S.%e [" + std::to_string(::getpid()) + ":%t] <%l> %v");
+const char* levelName(Level level) {
+  switch (level) {
+    case Level::Debug: return "debug";
+    case Level::Info: return "info";
+    case Level::Error: return "error";
   }
-  auto logger = std::make_shared<spdlog::logger>("telvane", sink);
-  logger->set_level(spdlog::level::trace);
-  logger->flush_on(spdlog::level::trace);
-  return logger;
+  return "info";
 }
 
 struct State {
   std::mutex mutex;
-  std::shared_ptr<spdlog::logger> logger = makeLogger(std::getenv("JOURNAL_STREAM") != nullptr);
+  Output output = nullptr;             // guarded by mutex; null: standard error
   std::vector<LogCapture*> captures;  // guarded by mutex
 };
 
@@ -54,16 +47,24 @@ State& state() {
 std::atomic<int> gLevel{static_cast<int>(levelFromEnvironment())};
 std::atomic<int> gCaptureCount{0};
 
-spdlog::level::level_enum toSpd(Level level) {
-  switch (level) {
-    case Level::Debug: return spdlog::level::debug;
-    case Level::Info: return spdlog::level::info;
-    case Level::Error: return spdlog::level::err;
-  }
-  return spdlog::level::info;
-}
-
 }  // namespace
+
+void writeStandardError(Level level, const std::string& line) {
+  using namespace std::chrono;
+  const auto now = system_clock::now();
+  const std::time_t seconds = system_clock::to_time_t(now);
+  const auto millis = duration_cast<milliseconds>(now.time_since_epoch()).count() % 1000;
+  std::tm local{};
+  ::localtime_r(&seconds, &local);
+  char stamp[32];
+  std::strftime(stamp, sizeof stamp, "%Y-%m-%d %H:%M:%S", &local);
+  static const long pid = static_cast<long>(::getpid());
+  const long tid = static_cast<long>(::syscall(SYS_gettid));
+  // One write per line, so that lines of several threads never interleave.
+  std::string out = fmt::format("{}.{:03d} [{}:{}] <{}> {}\n", stamp, static_cast<int>(millis), pid, tid,
+                                levelName(level), line);
+  std::fwrite(out.data(), 1, out.size(), stderr);
+}
 
 bool enabled(Level level) {
   return static_cast<int>(level) >= gLevel.load(std::memory_order_relaxed) ||
@@ -74,22 +75,29 @@ void write(Level level, std::string line) {
   // A line is one line: embedded line breaks would split it in the journal.
   std::replace(line.begin(), line.end(), '\n', ' ');
   State& s = state();
-  std::shared_ptr<spdlog::logger> logger;
+  Output output;
   {
     std::lock_guard<std::mutex> lock(s.mutex);
     for (auto* capture : s.captures) capture->append(level, line);
-    logger = s.logger;
+    output = s.output;
   }
-  if (static_cast<int>(level) >= gLevel.load(std::memory_order_relaxed)) logger->log(toSpd(level), line);
+  if (static_cast<int>(level) < gLevel.load(std::memory_order_relaxed)) return;
+  if (output) {
+    output(level, line);
+  } else {
+    writeStandardError(level, line);
+  }
 }
 
 void setLevel(Level level) { gLevel.store(static_cast<int>(level)); }
 
-void useStandardError() {
+void setOutput(Output output) {
   State& s = state();
   std::lock_guard<std::mutex> lock(s.mutex);
-  s.logger = makeLogger(false);
+  s.output = output;
 }
+
+void useStandardError() { setOutput(nullptr); }
 
 LogCapture::LogCapture() {
   State& s = state();

@@ -1,9 +1,11 @@
 // Logging: one process-wide logger with three levels.
 //
 // Lines are single lines, formatted printf-style (the texts of the system are printf
-// formats). Under systemd (JOURNAL_STREAM set) they go to the journal with their
-// priority, otherwise to standard error. The level comes from TELVANE_LOG_LEVEL
-// ("debug", "info", "error"; default info).
+// formats). They go to standard error ("2026-01-02 03:04:05.678 [pid:tid] <info> text")
+// unless an output is set: the daemon sets the one of LogOutput.h, which writes to the
+// journal under systemd. The client library keeps standard error, so that it needs no
+// logging library at run time. The level comes from TELVANE_LOG_LEVEL ("debug",
+// "info", "error"; default info).
 //
 // LogCapture collects every line written while it lives, whatever the level, so that
 // tests can assert exact texts. All functions here are thread-safe.
@@ -24,8 +26,13 @@ enum class Level { Debug = 0, Info = 1, Error = 2 };
 bool enabled(Level level);
 void write(Level level, std::string line);
 void setLevel(Level level);
-// Sends lines to standard error even under systemd (for command-line tools).
+// Where lines that pass the level go; null means standard error.
+using Output = void (*)(Level level, const std::string& line);
+void setOutput(Output output);
+// Sends lines to standard error again (for command-line tools).
 void useStandardError();
+// The standard-error output.
+void writeStandardError(Level level, const std::string& line);
 
 template <typename... Args>
 void debug(const char* format, const Args&... args) {

@@ -1,6 +1,7 @@
 #include "platform/Random.h"
 
-#include <openssl/rand.h>
+#include <fcntl.h>
+#include <unistd.h>
 #include <sys/random.h>
 
 #include <cerrno>
@@ -12,8 +13,27 @@ namespace telvane {
 
 namespace {
 
-// Randomness from the kernel (getrandom(2)); OpenSSL's generator stands in should the
-// system call be unavailable. Stateless, so safe from any thread.
+// Reads the rest from /dev/urandom: the stand-in for kernels without getrandom(2).
+bool readUrandom(std::uint8_t* data, std::size_t size) {
+  int fd = ::open("/dev/urandom", O_RDONLY | O_CLOEXEC);
+  if (fd < 0) return false;
+  std::size_t done = 0;
+  while (done < size) {
+    ssize_t n = ::read(fd, data + done, size - done);
+    if (n > 0) {
+      done += static_cast<std::size_t>(n);
+    } else if (n < 0 && errno == EINTR) {
+      continue;
+    } else {
+      break;
+    }
+  }
+  ::close(fd);
+  return done == size;
+}
+
+// Randomness from the kernel (getrandom(2)); /dev/urandom stands in should the system
+// call be unavailable. Stateless, so safe from any thread.
 class SystemRandom final : public Random {
  public:
   std::uint32_t uniform(std::uint32_t upperBound) override {
@@ -44,7 +64,7 @@ class SystemRandom final : public Random {
     if (done == size) return;
     // Bytes that are not random would be a silent disaster (identical UUIDs); when
     // neither source works the process cannot go on.
-    if (RAND_bytes(data + done, static_cast<int>(size - done)) != 1) {
+    if (!readUrandom(data + done, size - done)) {
       log::error("no source of random bytes is available");
       std::abort();
     }
