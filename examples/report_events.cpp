@@ -3,8 +3,10 @@
 //
 // A conferencing component reports one call: it opens a session with its user
 // information, starts it, sends ordinary events (batched by the daemon) and a realtime
-// one (sent at once), opens a child session for the call's media stream that shares
-// the call's data through the hierarchy token, flushes and finishes both sessions.
+// one (sent at once), lets a periodic task sample the call's statistics and report
+// them as one realtime event, opens a child session for the call's media stream that
+// shares the call's data through the hierarchy token, flushes and finishes both
+// sessions.
 //
 //   report_events [--component-type N] [--events N]
 //
@@ -20,8 +22,10 @@
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <deque>
 #include <future>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -39,10 +43,15 @@ constexpr std::chrono::seconds kReplyTimeout{15};
 constexpr std::uint16_t kCategoryCall = 12;
 constexpr std::uint16_t kTypeCallQuality = 1;
 constexpr std::uint16_t kTypeCallDropped = 2;
+constexpr std::uint16_t kTypeCallStats = 3;
 constexpr std::uint16_t kCategoryMedia = 13;
 constexpr std::uint16_t kTypeMediaStats = 1;
 // Event flag: sent at once instead of waiting for the next batch.
 constexpr std::uint32_t kFlagRealtime = 1;
+// The periodic call-statistics module: sampled every second, reported every second tick.
+constexpr std::uint32_t kModuleCallStats = 1;
+constexpr std::uint32_t kStatsIntervalSeconds = 1;
+constexpr std::uint32_t kStatsReportingMultiplier = 2;
 
 std::string joined(const std::vector<std::string>& names) {
   std::string text;
@@ -64,6 +73,43 @@ bool start(Telvane& session, const char* what) {
               joined(session.enabledBackendNames()).c_str());
   return true;
 }
+
+// A periodic module that samples the call on every tick of the log timer. Its block
+// cannot tell update ticks from report ticks, so it always hands over its latest
+// samples, as many as there are ticks per report; on a report tick they become the
+// event's "samples". The state is shared with the block, which the timer calls on the
+// library's own threads.
+class CallStatsModule {
+ public:
+  telvane::Telvane::PeriodicServiceBlock block() {
+    return [state = state_](Value& dictionary) {
+      std::lock_guard<std::mutex> lock(state->mutex);
+      ++state->ticks;
+      // Invented figures that change a little from tick to tick.
+      state->latest.push_back(Value(Dictionary{{"roundTripMs", Value(38 + 3 * state->ticks)},
+                                               {"jitterMs", Value(4.5 + 0.5 * state->ticks)}}));
+      if (state->latest.size() > kStatsReportingMultiplier) state->latest.pop_front();
+      telvane::Array samples(state->latest.begin(), state->latest.end());
+      dictionary.asDictionary()->set("samples", Value(std::move(samples)));
+      if (state->ticks == kStatsReportingMultiplier) state->reported.set_value(state->latest.size());
+    };
+  }
+  // The number of samples of the first report, or none when it did not come in time.
+  std::optional<std::size_t> waitForFirstReport() {
+    if (firstReport_.wait_for(kReplyTimeout) != std::future_status::ready) return std::nullopt;
+    return firstReport_.get();
+  }
+
+ private:
+  struct State {
+    std::mutex mutex;
+    long ticks = 0;
+    std::deque<Value> latest;
+    std::promise<std::size_t> reported;
+  };
+  std::shared_ptr<State> state_ = std::make_shared<State>();
+  std::future<std::size_t> firstReport_ = state_->reported.get_future();
+};
 
 // Flushes a session and waits for the daemon's answer.
 bool flush(Telvane& session, const char* what) {
@@ -156,6 +202,24 @@ int main(int argc, char** argv) {
     std::printf("call: realtime event refused: %s\n", error.description.c_str());
   } else {
     std::printf("call: the realtime event is filtered by the storebag\n");
+  }
+
+  {
+    // Call statistics from a periodic task: the first tick of the log timer comes at
+    // once and only updates, the second reports the module's samples as one realtime
+    // event of the call's category. The timer stops before the session finishes.
+    CallStatsModule stats;
+    call->registerPeriodicTaskForModule(kModuleCallStats, true, true, stats.block());
+    call->startLogTimerWithInterval(kStatsIntervalSeconds, kStatsReportingMultiplier, kCategoryCall, kTypeCallStats);
+    std::optional<std::size_t> samples = stats.waitForFirstReport();
+    call->stopLogTimer();
+    call->unregisterPeriodTaskForModule(kModuleCallStats);
+    if (samples) {
+      std::printf("call: a periodic task reported %zu call-stats samples as a realtime event\n", *samples);
+    } else {
+      std::printf("call: the periodic task did not report\n");
+      answered = false;
+    }
   }
 
   {

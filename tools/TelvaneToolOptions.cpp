@@ -31,6 +31,16 @@ const char* const kToolUsage =
     "  --timeout SECONDS           how long to wait for the daemon (default 10)\n"
     "  --verbose                   show the library's log lines on standard error\n"
     "\n"
+    "send, states and upload start a session and print what the daemon said, one fact\n"
+    "per line. An event is sent when the daemon answered it in a configured session;\n"
+    "events the session's lists refuse are filtered before they leave; the others are\n"
+    "not accepted (the session is not configured, or the daemon did not answer).\n"
+    "A session the daemon refuses is reported on standard error as\n"
+    "  telvane: the daemon refused the session: REASON\n"
+    "\n"
+    "exit status: 0 success; 1 the daemon refused the session, did not answer in time\n"
+    "or did not accept every event; 2 a malformed command line.\n"
+    "\n"
     "The daemon's socket is $TELVANED_SOCKET, else /run/telvaned/com.zembra.telvaned.\n";
 
 namespace {

@@ -12,7 +12,7 @@
 //   enabled backends: a, b | none
 //   whitelist: 1, 2 | none
 //   blacklist: none
-//   events: 3 sent, 0 filtered              (send)
+//   events: 3 sent, 0 filtered[, 1 not accepted]       (send)
 //   flush: ok | flush: failed: TEXT (DOMAIN, code N)   (send)
 //   file upload supported: yes | no         (upload)
 //   upload: succeeded | upload: failed      (upload)
@@ -20,17 +20,31 @@
 //   session: finished
 // `oneshot` prints `reply: TEXT` (or `reply: none`) per event.
 //
+// "start: not configured" means that the daemon has no configuration (storebag) for
+// the client type. An event counts as sent when the daemon answered it in a configured
+// session; events the session's lists refuse never leave the process and count as
+// filtered; the others are not accepted: the session is not configured (the daemon
+// has nothing to deliver them with) or the daemon did not answer them.
+//
+// A daemon that refuses the session (a caller without the entitlement, a session over
+// the limit of its client type) is reported on standard error as "telvane: the daemon
+// refused the session: REASON", with nothing on standard output.
+//
 // Errors go to standard error as "telvane: ..."; exit status 0 on success, 1 when the
-// daemon refused or did not answer in time, 2 for a malformed command line. The
-// library's own log lines appear on standard error only with --verbose.
+// daemon refused the session, did not answer in time or did not accept every event, 2
+// for a malformed command line. The library's own log lines appear on standard error
+// only with --verbose.
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <chrono>
+#include <condition_variable>
 #include <cstdio>
 #include <future>
+#include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
@@ -107,6 +121,39 @@ class Pending {
   std::future<T> future_ = state_->promise.get_future();
 };
 
+// Counts the daemon's answers to the events handed to it.
+class SendAnswers {
+ public:
+  Telvane::SendReply reply() {
+    return [state = state_](bool answered, const std::optional<std::string>&) {
+      {
+        std::lock_guard<std::mutex> lock(state->mutex);
+        ++(answered ? state->answered : state->unanswered);
+      }
+      state->changed.notify_all();
+    };
+  }
+  // Waits until every one of `count` events has had its answer or lost it, at most for
+  // the timeout; the number answered.
+  long long waitAnswered(long long count, double seconds) {
+    std::unique_lock<std::mutex> lock(state_->mutex);
+    state_->changed.wait_for(lock, std::chrono::duration<double>(seconds),
+                             [&] { return state_->answered + state_->unanswered >= count; });
+    return state_->answered;
+  }
+
+ private:
+  struct State {
+    std::mutex mutex;
+    std::condition_variable changed;
+    long long answered = 0;    // guarded by mutex
+    long long unanswered = 0;  // guarded by mutex
+  };
+  std::shared_ptr<State> state_ = std::make_shared<State>();
+};
+
+int refusedSession(const Error& refusal) { return fail("the daemon refused the session: " + refusal.description); }
+
 // The reply texts of the daemon, printed after the session's own lines.
 class ReplyLog {
  public:
@@ -153,24 +200,32 @@ std::unique_ptr<Telvane> openSession(const ToolOptions& options, int& exitCode) 
   }
 }
 
-// Starts the session and prints its states; false (with exitCode set) on a timeout.
-bool startSession(Telvane& session, const ToolOptions& options, int& exitCode) {
+// Starts the session and prints its states; false (with exitCode set) on a timeout or
+// when the daemon refused the session.
+bool startSession(Telvane& session, const ToolOptions& options, bool& configured, int& exitCode) {
   Pending<bool> started;
   session.startConfigurationWithCompletionHandler(started.setter());
-  auto configured = started.wait(options.timeoutSeconds);
-  if (!configured) {
+  auto received = started.wait(options.timeoutSeconds);
+  if (!received) {
     exitCode = fail("no start reply from the daemon within " + std::to_string(options.timeoutSeconds) + " s");
     return false;
   }
-  std::printf("start: %s\n", *configured ? "configured" : "not configured");
+  // Without a reply the library knows why by the time it says so.
+  if (auto refusal = session.connectionError(); !*received && refusal) {
+    exitCode = refusedSession(*refusal);
+    return false;
+  }
+  configured = *received;
+  std::printf("start: %s\n", configured ? "configured" : "not configured");
   std::printf("enabled backends: %s\n", joined(session.enabledBackendNames()).c_str());
   std::printf("whitelist: %s\n", joined(session.whitelistedEvents()).c_str());
   std::printf("blacklist: %s\n", joined(session.blacklistedEvents()).c_str());
   return true;
 }
 
-int sendEvents(Telvane& session, const ToolOptions& options) {
-  long long sent = 0, filtered = 0;
+int sendEvents(Telvane& session, const ToolOptions& options, bool configured) {
+  long long handedOver = 0, filtered = 0;
+  SendAnswers answers;
   for (long long i = 0; i < options.count; ++i) {
     telvane::Dictionary message{
         {telvane::kTelvaneMessageParametersCategory, Value(options.category)},
@@ -178,25 +233,39 @@ int sendEvents(Telvane& session, const ToolOptions& options) {
         {telvane::kTelvaneMessageParametersFlag, Value(options.flag)}};
     if (!options.payload.isNull()) message.set(telvane::kTelvaneMessageParametersPayload, options.payload);
     Error error;
-    if (session.sendMessageWithDictionary(Value(std::move(message)), &error)) {
-      ++sent;
+    if (session.sendMessageWithDictionary(Value(std::move(message)), &error, answers.reply())) {
+      ++handedOver;
     } else if (!error.domain.empty()) {
       return fail("event refused: " + errorText(error));
     } else {
       ++filtered;
     }
   }
-  std::printf("events: %lld sent, %lld filtered\n", sent, filtered);
+  const long long answered = answers.waitAnswered(handedOver, options.timeoutSeconds);
+  // A session without configuration has no backends: the daemon answers and drops.
+  const long long sent = configured ? answered : 0;
+  const long long notAccepted = handedOver - sent;
+  std::printf("events: %lld sent, %lld filtered", sent, filtered);
+  if (notAccepted > 0) std::printf(", %lld not accepted", notAccepted);
+  std::printf("\n");
+  if (auto refusal = session.connectionError()) return refusedSession(*refusal);
+
   Pending<std::optional<Error>> flushed;
   session.flushMessagesWithCompletion(flushed.setter());
   auto outcome = flushed.wait(options.timeoutSeconds);
   if (!outcome) return fail("no flush reply from the daemon within " + std::to_string(options.timeoutSeconds) + " s");
+  int exitCode = kExitOk;
   if (*outcome) {
     std::printf("flush: failed: %s\n", errorText(**outcome).c_str());
-    return kExitFailure;
+    exitCode = kExitFailure;
+  } else {
+    std::printf("flush: ok\n");
   }
-  std::printf("flush: ok\n");
-  return kExitOk;
+  if (notAccepted > 0) {
+    exitCode = fail(std::to_string(notAccepted) + " of " + std::to_string(handedOver) + " events not accepted: " +
+                    (configured ? "no answer from the daemon" : "the session is not configured"));
+  }
+  return exitCode;
 }
 
 // After a refused upload, names what the daemon refuses that can be seen from here:
@@ -231,8 +300,9 @@ int runSession(const ToolOptions& options) {
     std::unique_ptr<Telvane> session = openSession(options, exitCode);
     if (!session) return exitCode;
     session->setMessageLoggingBlock(replies.block());
-    if (!startSession(*session, options, exitCode)) return exitCode;
-    if (options.command == Command::Send) exitCode = sendEvents(*session, options);
+    bool configured = false;
+    if (!startSession(*session, options, configured, exitCode)) return exitCode;
+    if (options.command == Command::Send) exitCode = sendEvents(*session, options, configured);
     if (options.command == Command::Upload) exitCode = uploadFile(*session, options);
     session->finishSession();
     // Going away hands the finish to the daemon and closes the connection.

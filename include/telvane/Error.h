@@ -2,10 +2,11 @@
 // and from the daemon's replies. A plain value; copy it freely between threads.
 //
 // Errors of the library are in the domain "TelvaneErrorDomain" with these codes:
-// 2 session information missing, 3 component type invalid, 4 category 0. An event map
-// without its category or type gives code 7 with the missing-parameter text itself as
-// the domain; clients have long relied on that shape, so it stays. The daemon's own
-// refusals carry code -1, a server's refusal its HTTP status.
+// 2 session information missing, 3 component type invalid, 4 category 0, 8 the daemon
+// refused the session (the description is the daemon's reason). An event map without
+// its category or type gives code 7 with the missing-parameter text itself as the
+// domain; clients have long relied on that shape, so it stays. The daemon's own refusals
+// of a request carry code -1, a server's refusal its HTTP status.
 #pragma once
 
 #include <string>
@@ -22,6 +23,7 @@ struct Error {
   static constexpr long kCodeComponentTypeInvalid = 3;
   static constexpr long kCodeCategoryZero = 4;
   static constexpr long kCodeMissingParameter = 7;
+  static constexpr long kCodeRefusedByDaemon = 8;
 
   std::string domain;
   long code = 0;

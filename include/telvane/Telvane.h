@@ -25,6 +25,17 @@
 // When the daemon goes away, the next call makes a new connection, tells the new
 // daemon-side session the same session information first, restores the start and
 // the latest fetched user information, and then makes the call.
+//
+// Periodic metrics tasks: registrations and the log timer live on the reporting queue,
+// and the timer fires there, so ticks never overlap; module service blocks run on the
+// object's concurrent periodic-task queue, at most four at once. A tick occupies the
+// reporting queue until its modules are done, and under the log timer it waits for
+// them practically without a limit: a block that never returns holds the object's
+// calls to the daemon until the object goes away. Destroying the object stops the
+// timer; a tick in progress then gets at most one more second (its waits end by then,
+// logged as time-outs, and it sends what it collected). A block still running after
+// that finishes on its own thread; the library no longer touches the object for it,
+// and the block must not either.
 #pragma once
 
 #include <cstdint>
@@ -35,6 +46,7 @@
 #include <vector>
 
 #include "telvane/Error.h"
+#include "telvane/Export.h"
 #include "telvane/Value.h"
 
 namespace telvane {
@@ -42,13 +54,13 @@ namespace telvane {
 class Telvane;
 
 // Told of every event that a Telvane object accepted locally (held weakly).
-class TelvaneMessageSentDelegate {
+class TELVANE_EXPORT TelvaneMessageSentDelegate {
  public:
   virtual ~TelvaneMessageSentDelegate() = default;
   virtual void didSendMessageForReportingClient(Telvane& client, const Value& event) = 0;
 };
 
-class Telvane {
+class TELVANE_EXPORT Telvane {
  public:
   // Receives the messages an aggregating session forwards: the message (session
   // information of the sending session, or null), the time stamp in seconds, category,
@@ -66,6 +78,13 @@ class Telvane {
   using UploadDataCompletion = std::function<void(bool succeeded, const std::optional<Error>& error)>;
   // One-shot send: the daemon's reply text, or none when no reply came.
   using OneShotReply = std::function<void(const std::optional<std::string>& reply)>;
+  // What became of an event handed to the daemon: answered, with the daemon's reply
+  // text (none when no backend answered, as for a batched event or a session without
+  // configuration), or not answered because the connection ended first.
+  using SendReply = std::function<void(bool answered, const std::optional<std::string>& reply)>;
+  // A module's service block: fills the dictionary it is given (a fresh, empty
+  // dictionary Value each call). On report ticks the filled dictionary is the module's contribution.
+  using PeriodicServiceBlock = std::function<void(Value& dictionary)>;
 
   // Makes the object and connects it to the daemon, or returns nullptr: session
   // information missing (error code 2) or with a component type outside 5...30
@@ -101,6 +120,9 @@ class Telvane {
   // Sends an event map. False with error code 7 when category or type is missing,
   // code 4 for category 0, and false without an error when the local filter drops it.
   bool sendMessageWithDictionary(const Value& message, Error* error = nullptr);
+  // The same, and when the result is true `reply` is told once, on the reporting queue,
+  // whether the daemon answered the event (not after the object is gone).
+  bool sendMessageWithDictionary(const Value& message, Error* error, SendReply reply);
 
   // Asks the daemon to flush; always true.
   bool flushMessages();
@@ -129,6 +151,13 @@ class Telvane {
   std::vector<std::int64_t> whitelistedEvents() const;
   std::vector<std::int64_t> blacklistedEvents() const;
 
+  // Why the daemon refused this session (code Error::kCodeRefusedByDaemon, the daemon's
+  // reason as description, or "the daemon closed the connection" when it closed without
+  // one), known by the time the calls it left unanswered report their failure; none
+  // while the daemon has not refused it. A session refused with a reason makes no new
+  // connection.
+  std::optional<Error> connectionError() const;
+
   // Sends one event without a session object over a fresh connection; true unless
   // the session information or the category (0) is refused. The optional handler gets
   // the daemon's reply text.
@@ -145,10 +174,26 @@ class Telvane {
   static std::string getPersistentIdentifierForDNU(bool respect);
   static std::string regeneratePersistentIdentifierForDNU(bool respect);
 
-  class Impl;
+  // Periodic metrics tasks. Registers (or replaces) the module's service block; false
+  // without a block. The registration happens asynchronously on the reporting queue.
+  bool registerPeriodicTaskForModule(std::uint32_t module, bool needToUpdate, bool needToReport,
+                                     PeriodicServiceBlock serviceBlock);
+  // True when the module was registered. Waits for the reporting queue, so it must not
+  // be called from a completion, the logging block or a module's service block.
+  bool unregisterPeriodTaskForModule(std::uint32_t module);
+  // Starts the log timer (nothing when one runs): it fires at once and then every
+  // interval; every reportingMultiplier-th firing sends the modules' merged
+  // contributions as one realtime event of the category and type, the others let the
+  // modules update.
+  void startLogTimerWithInterval(std::uint32_t intervalSeconds, std::uint32_t reportingMultiplier,
+                                 std::uint16_t category, std::uint16_t type);
+  // Stops the log timer and restarts the tick count.
+  void stopLogTimer();
+
+  class TELVANE_HIDDEN Impl;
 
  private:
-  explicit Telvane(std::shared_ptr<Impl> impl);
+  TELVANE_HIDDEN explicit Telvane(std::shared_ptr<Impl> impl);
 
   std::shared_ptr<Impl> impl_;
 };

@@ -15,22 +15,23 @@
 #include <string>
 
 #include "telvane/Error.h"
+#include "telvane/Export.h"
 #include "telvane/Telvane.h"
 #include "telvane/Value.h"
 
 namespace telvane {
 
-bool TelvaneSendMessageWithError(Telvane* handle, std::uint16_t category, std::uint16_t type, const Value& payload,
+TELVANE_EXPORT bool TelvaneSendMessageWithError(Telvane* handle, std::uint16_t category, std::uint16_t type, const Value& payload,
                                  std::optional<Error>* error);
-bool TelvaneSendMessageWithDictionary(Telvane* handle, const Value& message, std::optional<Error>* error);
-bool TelvaneFlushMessages(Telvane* handle);
-void TelvaneFlushMessagesWithCompletion(Telvane* handle, Telvane::FlushCompletion completion);
-void TelvaneUpdateSharedDataWithDictionary(Telvane* handle, const Value& sharedData);
-void TelvaneUpdateSharedDataForKey(Telvane* handle, const std::string& key, const Value& value);
-Value TelvaneNewHierarchyTokenFromParentToken(const Value& parentToken);
-Value TelvaneCreateHierarchyTokenFromParentToken(const Value& parentToken);
-void TelvaneSetMessageBlock(Telvane* handle, std::function<void(const std::string& text)> block);
-void TelvaneFetchStatesWithUserInfo(Telvane* handle, const Value& userInfo, Telvane::StatesCompletion completion);
-bool TelvaneUploadLogWithArray(Telvane* handle, const Value& logDataArray);
+TELVANE_EXPORT bool TelvaneSendMessageWithDictionary(Telvane* handle, const Value& message, std::optional<Error>* error);
+TELVANE_EXPORT bool TelvaneFlushMessages(Telvane* handle);
+TELVANE_EXPORT void TelvaneFlushMessagesWithCompletion(Telvane* handle, Telvane::FlushCompletion completion);
+TELVANE_EXPORT void TelvaneUpdateSharedDataWithDictionary(Telvane* handle, const Value& sharedData);
+TELVANE_EXPORT void TelvaneUpdateSharedDataForKey(Telvane* handle, const std::string& key, const Value& value);
+TELVANE_EXPORT Value TelvaneNewHierarchyTokenFromParentToken(const Value& parentToken);
+TELVANE_EXPORT Value TelvaneCreateHierarchyTokenFromParentToken(const Value& parentToken);
+TELVANE_EXPORT void TelvaneSetMessageBlock(Telvane* handle, std::function<void(const std::string& text)> block);
+TELVANE_EXPORT void TelvaneFetchStatesWithUserInfo(Telvane* handle, const Value& userInfo, Telvane::StatesCompletion completion);
+TELVANE_EXPORT bool TelvaneUploadLogWithArray(Telvane* handle, const Value& logDataArray);
 
 }  // namespace telvane

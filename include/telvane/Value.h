@@ -26,6 +26,8 @@
 #include <variant>
 #include <vector>
 
+#include "telvane/Export.h"
+
 namespace telvane {
 
 class Value;
@@ -42,7 +44,7 @@ struct Date {
   bool operator==(const Date&) const = default;
 };
 
-class Value {
+class TELVANE_EXPORT Value {
  public:
   enum class Type { Null, Boolean, Integer, Unsigned, Double, String, Bytes, Date, Array, Dictionary };
 
@@ -144,7 +146,7 @@ class Value {
 // A dictionary with string keys, kept sorted by key so that iteration, descriptions
 // and encodings are deterministic. Small maps dominate (event records, payloads), so
 // a sorted vector beats a node-based map here.
-class Dictionary {
+class TELVANE_EXPORT Dictionary {
  public:
   using Entry = std::pair<std::string, Value>;
   using const_iterator = std::vector<Entry>::const_iterator;
@@ -190,8 +192,8 @@ inline Value Value::array() { return Value(Array{}); }
 inline Value Value::dictionary() { return Value(Dictionary{}); }
 
 // Coercion helpers over raw text, shared with decoders and command-line parsing.
-std::int64_t integerFromText(std::string_view text);
-double doubleFromText(std::string_view text);
-bool boolFromText(std::string_view text);
+TELVANE_EXPORT std::int64_t integerFromText(std::string_view text);
+TELVANE_EXPORT double doubleFromText(std::string_view text);
+TELVANE_EXPORT bool boolFromText(std::string_view text);
 
 }  // namespace telvane

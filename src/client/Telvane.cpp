@@ -3,6 +3,7 @@
 #include <mutex>
 
 #include "client/ClientErrors.h"
+#include "client/DaemonIdentifiers.h"
 #include "client/OneShotSender.h"
 #include "client/TelvaneAggregationObject.h"
 #include "client/TelvaneConnection.h"
@@ -11,7 +12,6 @@
 #include "platform/Paths.h"
 #include "platform/Random.h"
 #include "telvane/TelvaneKeys.h"
-#include "util/PersistentIdentifiers.h"
 
 namespace telvane {
 
@@ -115,6 +115,12 @@ bool Telvane::sendMessageWithDictionary(const Value& message, Error* error) {
   return impl_->sendMessageWithDictionary(message, error);
 }
 
+bool Telvane::sendMessageWithDictionary(const Value& message, Error* error, SendReply reply) {
+  return impl_->sendMessageWithDictionary(message, error, std::move(reply));
+}
+
+std::optional<Error> Telvane::connectionError() const { return impl_->connectionError(); }
+
 bool Telvane::flushMessages() {
   log::info("flushMessages:");
   impl_->flushMessagesWithCompletion(nullptr);
@@ -175,14 +181,10 @@ Value Telvane::newHierarchyTokenFromParentToken(const Value& parentToken) {
   return Value(std::move(token));
 }
 
-std::string Telvane::getPersistentIdentifierForDNU(bool respect) {
-  std::lock_guard<std::recursive_mutex> lock(telvaneClassLock());
-  return telvane::getPersistentIdentifierForDNU(respect);
-}
+std::string Telvane::getPersistentIdentifierForDNU(bool respect) { return DaemonIdentifiers::get(respect); }
 
 std::string Telvane::regeneratePersistentIdentifierForDNU(bool respect) {
-  std::lock_guard<std::recursive_mutex> lock(telvaneClassLock());
-  return telvane::regeneratePersistentIdentifierForDNU(respect);
+  return DaemonIdentifiers::regenerate(respect);
 }
 
 }  // namespace telvane

@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cerrno>
 
+#include "client/ClientErrors.h"
 #include "platform/Log.h"
 #include "platform/Paths.h"
 
@@ -43,6 +44,13 @@ Result<std::shared_ptr<IpcConnection>> TelvaneConnection::connectAndConfigure() 
   if (!connected) return connected;
   std::shared_ptr<IpcConnection> connection = connected.value();
   auto pending = std::make_shared<PendingCalls>();
+  std::uint64_t generation = 0;
+  {
+    std::lock_guard<std::mutex> lock(refusalMutex_);
+    generation = ++connectionGeneration_;
+    // A new connection is a new try after a daemon that closed without a reason.
+    if (!refusalIsFinal_) refusal_.reset();
+  }
 
   connection->setCallHandler([exported = exportedObject_](IpcConnection::IncomingCall& call) {
     if (call.operation != ipc::Operation::SendMessageToClient) return;
@@ -59,8 +67,13 @@ Result<std::shared_ptr<IpcConnection>> TelvaneConnection::connectAndConfigure() 
     }
     pending->changed.notify_all();
   });
-  connection->setInterruptionHandler([pending, queue = reportingQueue_] {
+  connection->setInterruptionHandler([pending, queue = reportingQueue_, weak = weak_from_this(), generation,
+                                      weakConnection = std::weak_ptr<IpcConnection>(connection)] {
     log::info("initWithSessionInfo: IPC connection interrupted");
+    // Known before the lost actions run, so that a completion told "no reply" can ask why.
+    auto self = weak.lock();
+    auto ended = weakConnection.lock();
+    if (self && ended) self->noteConnectionEnded(generation, *ended);
     std::unordered_map<std::uint64_t, LostHandler> lost;
     {
       std::lock_guard<std::mutex> lock(pending->mutex);
@@ -89,6 +102,10 @@ Result<std::shared_ptr<IpcConnection>> TelvaneConnection::connectAndConfigure() 
 Result<std::shared_ptr<IpcConnection>> TelvaneConnection::remote(Restore restore) {
   assertOnQueue(reportingQueue_);
   if (closed_) return Result<std::shared_ptr<IpcConnection>>::failure("the connection has been closed");
+  // Asking again would only be refused again.
+  if (auto refused = finalRefusal()) {
+    return Result<std::shared_ptr<IpcConnection>>::failure("the daemon refused the session: " + *refused);
+  }
   if (current_ && current_->isValid()) return Result<std::shared_ptr<IpcConnection>>::success(current_);
   auto connection = connectAndConfigure();
   if (!connection) return connection;
@@ -172,6 +189,40 @@ void TelvaneConnection::waitForReplies(std::chrono::milliseconds timeout) {
   if (!pending) return;
   std::unique_lock<std::mutex> lock(pending->mutex);
   pending->changed.wait_for(lock, timeout, [&] { return pending->ended || pending->lost.empty(); });
+}
+
+void TelvaneConnection::noteConnectionEnded(std::uint64_t generation, const IpcConnection& connection) {
+  std::optional<std::string> reason = connection.peerRefusal();
+  std::lock_guard<std::mutex> lock(refusalMutex_);
+  if (reason) {
+    log::info("initWithSessionInfo: The daemon refused the session: %s", *reason);
+    refusal_ = std::move(reason);
+    refusalIsFinal_ = true;
+    return;
+  }
+  // An older connection ending late says nothing about the current one.
+  if (refusalIsFinal_ || generation != connectionGeneration_ || !connection.peerClosedBeforeHello()) return;
+  log::info("initWithSessionInfo: The daemon closed the connection before saying hello");
+  refusal_ = kClosedBeforeHelloText;
+}
+
+std::optional<std::string> TelvaneConnection::finalRefusal() {
+  // The refusal may have arrived with the daemon's close still on its way; it counts
+  // from now on.
+  std::optional<std::string> received = current_ ? current_->peerRefusal() : std::nullopt;
+  std::lock_guard<std::mutex> lock(refusalMutex_);
+  if (received && !refusalIsFinal_) {
+    refusal_ = std::move(received);
+    refusalIsFinal_ = true;
+  }
+  if (refusalIsFinal_) return refusal_;
+  return std::nullopt;
+}
+
+std::optional<Error> TelvaneConnection::connectionError() const {
+  std::lock_guard<std::mutex> lock(refusalMutex_);
+  if (!refusal_) return std::nullopt;
+  return client::makeError(Error::kCodeRefusedByDaemon, *refusal_);
 }
 
 void TelvaneConnection::close() {

@@ -9,8 +9,15 @@
 // replies of these restoring calls refresh the cached lists through the restored-states
 // handler; they never call a client's completion).
 //
-// Threading: open() runs once on the creating thread before any other use; every
-// other member function runs on the reporting queue (asserted in debug builds).
+// Refusal: a daemon that refuses the session says why before it closes (see
+// IpcConnection::refuse). The reason is kept and the calls still waiting are lost at
+// once; after such a refusal no new connection is made. A daemon that closes a
+// connection before saying hello (one that refuses without a reason) counts as a
+// refusal too, but the next call tries a new connection.
+//
+// Threading: open() runs once on the creating thread before any other use;
+// connectionError() may be called from any thread; every other member function runs on
+// the reporting queue (asserted in debug builds).
 // Replies and lost actions are handed to the reporting queue. The IPC connection
 // itself runs on the connection queue, which also runs the aggregation object.
 #pragma once
@@ -31,6 +38,7 @@
 #include "platform/Result.h"
 #include "platform/SerialQueue.h"
 #include "platform/UniqueFd.h"
+#include "telvane/Error.h"
 #include "telvane/Value.h"
 
 namespace telvane {
@@ -46,6 +54,9 @@ class TelvaneConnection : public std::enable_shared_from_this<TelvaneConnection>
   };
   using ReplyHandler = std::function<void(Array arguments)>;
   using LostHandler = std::function<void()>;
+  // The description of the refusal by a daemon that closed before saying hello.
+  static constexpr const char* kClosedBeforeHelloText = "the daemon closed the connection";
+
   // Which part of the session state the call that triggers a reconnection restores
   // itself, so that it is not sent twice.
   enum class Restore { All, ExceptStart, ExceptFetch };
@@ -88,6 +99,12 @@ class TelvaneConnection : public std::enable_shared_from_this<TelvaneConnection>
   // afterwards.
   void close();
 
+  // Why the daemon refused the session: an error of code Error::kCodeRefusedByDaemon
+  // with the daemon's reason, or kClosedBeforeHelloText, as soon as the connection has
+  // ended that way (before the lost actions of its calls run). None otherwise, and
+  // again once a new connection follows a close before hello. Any thread.
+  std::optional<Error> connectionError() const;
+
   const std::shared_ptr<SerialQueue>& connectionQueue() const { return connectionQueue_; }
 
  private:
@@ -107,6 +124,12 @@ class TelvaneConnection : public std::enable_shared_from_this<TelvaneConnection>
   // Makes and resumes a new IPC connection with the handlers, then says setSessionInfo.
   Result<std::shared_ptr<IpcConnection>> connectAndConfigure();
   void restoreSession(const std::shared_ptr<IpcConnection>& connection, Restore restore);
+  // Keeps what the end of the connection of the generation says about a refusal
+  // (connection queue, before the lost actions are handed over).
+  void noteConnectionEnded(std::uint64_t generation, const IpcConnection& connection);
+  // The daemon's reason when it refused for good: kept from an ended connection, or
+  // already received on the current one, which is kept from then on (reporting queue).
+  std::optional<std::string> finalRefusal();
 
   // Constant after construction.
   const SessionSetup setup_;
@@ -123,6 +146,13 @@ class TelvaneConnection : public std::enable_shared_from_this<TelvaneConnection>
   std::optional<Bytes> digestKey_;
   std::int32_t digestAlgorithm_ = 0;
   ReplyHandler restoredStatesHandler_;
+
+  // Written when a connection is made (reporting queue) and when it ends (connection
+  // queue); read from any thread.
+  mutable std::mutex refusalMutex_;
+  std::uint64_t connectionGeneration_ = 0;  // guarded by refusalMutex_; the latest connection's
+  std::optional<std::string> refusal_;      // guarded by refusalMutex_
+  bool refusalIsFinal_ = false;             // guarded by refusalMutex_; the daemon gave a reason
 };
 
 }  // namespace telvane

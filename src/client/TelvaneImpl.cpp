@@ -25,7 +25,8 @@ Telvane::Impl::Impl(std::shared_ptr<SerialQueue> reportingQueue, std::shared_ptr
                     std::shared_ptr<TelvaneAggregationObject> aggregationObject)
     : reportingQueue_(std::move(reportingQueue)),
       connection_(std::move(connection)),
-      aggregationObject_(std::move(aggregationObject)) {}
+      aggregationObject_(std::move(aggregationObject)),
+      reportingPeriodicTasksQueue_(ConcurrentQueue::create(kPeriodicTaskQueueLabel)) {}
 
 void Telvane::Impl::setOwner(Telvane* owner) {
   std::lock_guard<std::recursive_mutex> lock(ownerMutex_);
@@ -34,6 +35,7 @@ void Telvane::Impl::setOwner(Telvane* owner) {
 
 void Telvane::Impl::teardown() {
   log::info("aboutToDealloc: Client stops logging...");
+  stopPeriodicTasks();
   const std::shared_ptr<SerialQueue>& connectionQueue = connection_->connectionQueue();
   if (!reportingQueue_->isCurrent() && !connectionQueue->isCurrent()) {
     // Let the queued calls run and hand their messages to the connection, give the
@@ -206,7 +208,7 @@ std::vector<std::int64_t> Telvane::Impl::blacklistedEvents() const {
   return blacklistedEvents_;
 }
 
-bool Telvane::Impl::sendMessageWithDictionary(const Value& message, Error* error) {
+bool Telvane::Impl::sendMessageWithDictionary(const Value& message, Error* error, SendReply sendReply) {
   const Value& categoryValue = message[kTelvaneMessageParametersCategory];
   if (categoryValue.isNull()) {
     if (error) *error = client::missingParameterError("Missing mandatory parameter 'category'");
@@ -228,21 +230,25 @@ bool Telvane::Impl::sendMessageWithDictionary(const Value& message, Error* error
     log::info("Event %u is filtered by storebag", static_cast<unsigned>(category));
     return false;
   }
-  reportingQueue_->async([self = shared_from_this(), event] {
+  reportingQueue_->async([self = shared_from_this(), event, sendReply = std::move(sendReply)] {
     auto remote = self->connection_->remote();
     if (!remote) {
       log::info("sendMessageWithDictionary: Failed to get remote object proxy: %s", remote.error());
+      if (sendReply) sendReply(false, std::nullopt);
       return;
     }
+    TelvaneConnection::LostHandler lost;
+    if (sendReply) lost = [sendReply] { sendReply(false, std::nullopt); };
     self->connection_->call(
         remote.value(), ipc::Operation::SendMessageWithDictionary, Array{event},
-        [weak = self->weak_from_this()](Array reply) {
+        [weak = self->weak_from_this(), sendReply](Array reply) {
           const Value text = reply.empty() ? Value() : reply[0];
           log::info("sendMessageWithDictionary: %s", textOrNull(text));
           auto impl = weak.lock();
           if (impl && text.isString()) impl->logToBlock(*text.asString());
+          if (sendReply) sendReply(true, text.isString() ? std::optional<std::string>(*text.asString()) : std::nullopt);
         },
-        nullptr);
+        std::move(lost));
   });
   return true;
 }

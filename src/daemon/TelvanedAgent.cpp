@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cstdio>
+#include <string>
 
 #include "platform/EntitlementPolicy.h"
 #include "platform/Log.h"
@@ -38,7 +39,7 @@ std::shared_ptr<TelvanedSession> TelvanedAgent::acceptConnection(UniqueFd socket
   auto connection =
       IpcConnection::adopt(std::move(socket), SerialQueue::create(kSessionQueueLabel), IpcConnection::Side::Daemon);
   auto session = acceptNewConnection(connection);
-  if (!session) connection->invalidate();
+  if (!session) connection->refuse(kNotEntitledRefusal);
   return session;
 }
 
@@ -161,7 +162,7 @@ bool TelvanedAgent::isActiveClientLimitReachedForSession(const SessionRef& sessi
     log::error("isActiveClientLimitReachedForSession: session %u missing clientType in its sessionInfo %s. Session "
                "terminated...",
                session->sessionID(), objectDescription(sessionInfo));
-    session->invalidate();
+    session->refuse(kNoClientTypeRefusal);
     return true;
   }
   long index = static_cast<long>(componentType.integerValue());
@@ -177,7 +178,8 @@ bool TelvanedAgent::isActiveClientLimitReachedForSession(const SessionRef& sessi
   log::debug("isActiveClientLimitReachedForSession: active session count for clientType %d got incremented to %d",
              index, static_cast<unsigned>(slot));
   if (old < kMaxActiveClientsPerType) return false;
-  session->invalidate();
+  session->refuse("too many active sessions for client type " + std::to_string(index) + " (at most " +
+                  std::to_string(kMaxActiveClientsPerType) + ")");
   return true;
 }
 

@@ -56,6 +56,12 @@ class TelvanedAgent : public TelvanedSessionDelegate, public std::enable_shared_
   static constexpr unsigned kMaxActiveClientsPerType = 5;
   // Component types 0..29 have a slot of the counter array.
   static constexpr std::size_t kActiveClientSlots = 30;
+  // What a refused client is told (the log lines stay as they are): a caller without
+  // the entitlement, and a session whose first counted call has no component type.
+  // The limit's refusal names the type: "too many active sessions for client type 7
+  // (at most 5)".
+  static constexpr const char* kNotEntitledRefusal = "missing the entitlement com.zembra.private.telvaned";
+  static constexpr const char* kNoClientTypeRefusal = "no ComponentType in the session information";
 
   using EntitlementLookup =
       std::function<std::optional<bool>(const IpcConnection& connection, const std::string& entitlement)>;
@@ -84,7 +90,8 @@ class TelvanedAgent : public TelvanedSessionDelegate, public std::enable_shared_
 
   // ---- Listener delegate ----
   // The listener's accept handler: wraps the socket in a daemon-side connection on a
-  // new serial queue and runs shouldAcceptNewConnection (a refusal closes it).
+  // new serial queue and runs shouldAcceptNewConnection (a refusal tells the caller
+  // kNotEntitledRefusal and closes the connection).
   // Returns the new session, or nullptr when the connection was refused.
   std::shared_ptr<TelvanedSession> acceptConnection(UniqueFd socket);
   // listener:shouldAcceptNewConnection:

@@ -290,7 +290,10 @@ void IpcConnection::onReadable() {
       if (errno == EINTR) continue;
       if (errno == EAGAIN || errno == EWOULDBLOCK) break;
       if (errno == ECONNRESET) {
-        peerClosed(input_.size() > inputOffset_);
+        // A peer that closes without reading what we sent resets the connection; what
+        // it wrote before (a refusal) has been read and is handled first.
+        parseFrames();
+        if (!finished_) peerClosed(input_.size() > inputOffset_);
       } else {
         fail(std::string("receive failed: ") + std::strerror(errno));
       }
@@ -320,7 +323,7 @@ void IpcConnection::onReadable() {
 }
 
 void IpcConnection::parseFrames() {
-  while (!finished_) {
+  while (!finished_ && !refusing_) {
     std::size_t available = input_.size() - inputOffset_;
     if (available < kHeaderBytes) break;
     const auto* data = reinterpret_cast<const std::uint8_t*>(input_.data()) + inputOffset_;
@@ -374,10 +377,18 @@ bool IpcConnection::handleMessage(const std::uint8_t* body, std::size_t size) {
     }
     helloReceived_ = true;
     helloTimer_.cancel();
+    notePeerRefusal(arguments);
     return true;
   }
   switch (messageKind) {
-    case ipc::MessageKind::Hello: fail("second hello"); return false;
+    case ipc::MessageKind::Hello:
+      // After the first hello only a refusal may come; the peer closes behind it.
+      if (arguments.size() >= 2 && arguments[1].isString()) {
+        notePeerRefusal(arguments);
+        return true;
+      }
+      fail("second hello");
+      return false;
     case ipc::MessageKind::Call:
     case ipc::MessageKind::CallNoReply:
       return handleCall(messageKind, id, static_cast<std::uint16_t>(code), std::move(arguments),
@@ -418,7 +429,7 @@ bool IpcConnection::handleCall(ipc::MessageKind kind, std::uint64_t id, std::uin
     };
   }
   if (callHandler_) callHandler_(call);
-  return !finished_;
+  return !finished_ && !refusing_;
 }
 
 bool IpcConnection::handleReply(std::uint64_t id, std::uint16_t code, Array arguments) {
@@ -436,7 +447,7 @@ bool IpcConnection::handleReply(std::uint64_t id, std::uint16_t code, Array argu
   ReplyHandler handler = std::move(it->second);
   pendingReplies_.erase(it);
   handler(std::move(arguments));
-  return !finished_;
+  return !finished_ && !refusing_;
 }
 
 void IpcConnection::fail(const std::string& reason) {
@@ -447,7 +458,9 @@ void IpcConnection::fail(const std::string& reason) {
 
 void IpcConnection::peerClosed(bool midFrame) {
   if (finished_) return;
-  if (midFrame) {
+  if (!helloReceived_) peerClosedBeforeHello_ = true;
+  // After a refusal what the peer still sent is left unread on purpose.
+  if (midFrame && !refusing_) {
     log::error("IpcConnection: closing connection %s: the peer closed in the middle of a message", description_);
   } else {
     log::debug("IpcConnection: connection %s closed by the peer", description_);
@@ -457,6 +470,40 @@ void IpcConnection::peerClosed(bool midFrame) {
 
 void IpcConnection::invalidate() {
   queue_->async([self = shared_from_this()] { self->finish(false); });
+}
+
+void IpcConnection::refuse(const std::string& reason) {
+  std::string hello =
+      encodeFrame(ipc::MessageKind::Hello, 0, 0, Array{Value(ipc::kProtocolVersion), Value(reason)}, 0);
+  auto refuseOnQueue = [self = shared_from_this(), hello = std::move(hello)]() mutable {
+    if (self->finished_ || self->finishing_ || self->refusing_) return;
+    self->refusing_ = true;
+    // A connection that was never resumed stays unread: the refusal stands in for its
+    // hello, and a later resume() does nothing.
+    self->resumed_ = true;
+    self->enqueueOnQueue(OutgoingFrame{std::move(hello), {}, 0});
+    // The end comes after the task that refused, so that the reply it may still give
+    // goes out behind the refusal.
+    self->queue_->async([self] { self->finish(false); });
+  };
+  if (queue_->isCurrent()) {
+    refuseOnQueue();
+  } else {
+    queue_->async(std::move(refuseOnQueue));
+  }
+}
+
+std::optional<std::string> IpcConnection::peerRefusal() const {
+  std::lock_guard<std::mutex> lock(refusalMutex_);
+  return peerRefusal_;
+}
+
+void IpcConnection::notePeerRefusal(const Array& helloArguments) {
+  if (helloArguments.size() < 2 || !helloArguments[1].isString()) return;
+  std::string reason = *helloArguments[1].asString();
+  log::info("IpcConnection: %s: the peer refuses the connection: %s", description_, reason);
+  std::lock_guard<std::mutex> lock(refusalMutex_);
+  peerRefusal_ = std::move(reason);
 }
 
 void IpcConnection::finish(bool interrupted) {

@@ -6,6 +6,12 @@
 // calls. Each reply handler runs at most once; replies still pending when the
 // connection ends are dropped without being called.
 //
+// Refusal: refuse() tells the peer why this side ends the connection (a hello carrying
+// the reason, see IpcProtocol.h) and then ends it. On the receiving side the reason is
+// kept (peerRefusal()) and the connection reads on until the peer closes, so replies
+// sent before the refusal's close are still delivered; the owner reads the reason in
+// its interruption or invalidation handler.
+//
 // Anything the peer sends that breaks the protocol (a frame over kMaxMessageBytes, a
 // body that is not MessagePack, an unknown operation, wrong argument types, a close
 // in the middle of a frame, no hello in time) ends this connection with an
@@ -33,6 +39,7 @@
 #include <deque>
 #include <functional>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <unordered_map>
@@ -100,8 +107,21 @@ class IpcConnection : public std::enable_shared_from_this<IpcConnection> {
 
   // Ends the connection (see above). Idempotent.
   void invalidate();
+  // Tells the peer why, then ends the connection like invalidate(). Never resumed: the
+  // refusal is the only thing this side says (nothing is read). Resumed: the refusal
+  // follows what is already queued, calls from the peer that have not been handled yet
+  // are dropped, and a reply given on the queue before the end still goes out (a session
+  // that refuses itself answers the call that made it do so). Later calls of refuse()
+  // or invalidate() do nothing more.
+  void refuse(const std::string& reason);
   // False once the connection has ended (for whatever reason).
   bool isValid() const { return !finished_.load(); }
+  // The reason the peer gave when it refused the connection; none when it did not.
+  // Set before the handlers run.
+  std::optional<std::string> peerRefusal() const;
+  // True when the peer closed the connection before it said hello (a peer that ends a
+  // connection it never accepted, without saying why). Set before the handlers run.
+  bool peerClosedBeforeHello() const { return peerClosedBeforeHello_.load(); }
 
   const PeerCredentials& peer() const { return peer_; }
   // "pid 123 uid 1000" on the daemon side, the socket path on the client side.
@@ -127,6 +147,8 @@ class IpcConnection : public std::enable_shared_from_this<IpcConnection> {
   bool handleCall(ipc::MessageKind kind, std::uint64_t id, std::uint16_t code, Array arguments,
                   std::size_t descriptorCount);
   bool handleReply(std::uint64_t id, std::uint16_t code, Array arguments);
+  // Keeps the refusal text of a hello's arguments, when there is one.
+  void notePeerRefusal(const Array& helloArguments);
   void flushWrites();
   void waitWritable();
   void sendReply(std::uint64_t id, std::uint16_t code, Array arguments);
@@ -145,6 +167,10 @@ class IpcConnection : public std::enable_shared_from_this<IpcConnection> {
   std::chrono::milliseconds helloTimeout_{std::chrono::seconds(ipc::kHelloTimeoutSeconds)};
   std::atomic<bool> finished_{false};
   std::atomic<std::uint64_t> nextId_{1};
+  std::atomic<bool> peerClosedBeforeHello_{false};
+
+  mutable std::mutex refusalMutex_;
+  std::optional<std::string> peerRefusal_;  // guarded by refusalMutex_
 
   // Everything below lives on queue_.
   asio::posix::stream_descriptor socket_;
@@ -156,6 +182,8 @@ class IpcConnection : public std::enable_shared_from_this<IpcConnection> {
   bool helloReceived_ = false;
   bool writeWaiting_ = false;
   bool finishing_ = false;
+  // This side has refused the connection: nothing more from the peer is handled.
+  bool refusing_ = false;
   std::string input_;
   std::size_t inputOffset_ = 0;
   std::deque<UniqueFd> receivedDescriptors_;

@@ -3,7 +3,11 @@
 //
 // A message on the wire is a 4-byte big-endian length followed by a MessagePack
 // array [kind, id, operation, arguments, descriptor count]. The first message each
-// side sends is a hello whose arguments hold the protocol version. A call expecting a
+// side sends is a hello whose arguments hold the protocol version. A side that refuses
+// the connection says why in a hello of its own, [version, reason text], right before
+// it closes: as its first message (the daemon refusing a caller at accept) or after
+// its first hello (a session refused later); the peer keeps the reason and reads on
+// until the end, so that replies sent before the close still arrive. A call expecting a
 // reply carries a fresh id; the reply carries the same id and the operation code of
 // the call, with the reply block's arguments. File descriptors travel with the message
 // that names their count (SCM_RIGHTS on the message's first bytes).
@@ -52,6 +56,8 @@ enum class Operation : std::uint16_t {
   UpdateSharedDataWithDictionary = 11,
   UpdateSharedDataForKey = 12,
   SetDigestKey = 13,
+  GetPersistentIdentifierForDNU = 14,
+  RegeneratePersistentIdentifierForDNU = 15,
   // ClientSessionReplyInterface (daemon → client)
   SendMessageToClient = 64,
 };

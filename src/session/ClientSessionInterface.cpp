@@ -117,6 +117,12 @@ void ClientSessionInterface::dispatch(TelvanedSession& session, IpcConnection::I
       session.setDigestKey(key ? *key : Bytes{}, args[1].intValue());
       break;
     }
+    case ipc::Operation::GetPersistentIdentifierForDNU:
+      session.persistentIdentifierForDNU(args[0].boolValue(), false, textReply(std::move(call.reply)));
+      break;
+    case ipc::Operation::RegeneratePersistentIdentifierForDNU:
+      session.persistentIdentifierForDNU(args[0].boolValue(), true, textReply(std::move(call.reply)));
+      break;
     case ipc::Operation::None:
     case ipc::Operation::SendMessageToClient:
       // The connection refuses these before they get here.

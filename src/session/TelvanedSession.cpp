@@ -73,6 +73,16 @@ void TelvanedSession::invalidate() {
   if (connection) connection->invalidate();
 }
 
+void TelvanedSession::refuse(const std::string& reason) {
+  std::shared_ptr<IpcConnection> connection;
+  {
+    std::lock_guard<std::mutex> lock(mutex_);
+    connection = std::move(connection_);
+    connection_.reset();
+  }
+  if (connection) connection->refuse(reason);
+}
+
 void TelvanedSession::scheduleTeardown() {
   if (teardownScheduled_.exchange(true)) return;
   queue_->async([self = shared_from_this()] { self->teardown(); });

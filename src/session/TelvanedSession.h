@@ -90,10 +90,17 @@ class TelvanedSession : public std::enable_shared_from_this<TelvanedSession> {
   // A null value removes the key.
   void updateSharedDataForKey(const std::string& key, const Value& value);
   void setDigestKey(const Bytes& key, std::int32_t algorithm);
+  // The device's persistent identifier that respects (or overrides) the user's
+  // diagnostics-sharing choice; with `regenerate` a new one is stored first. The client
+  // class's identifier operations ask for it on a connection of their own.
+  void persistentIdentifierForDNU(bool respect, bool regenerate, TextReply reply);
 
   // ---- Lifecycle ----
   // Closes the connection; the agent then removes the session. Any thread.
   void invalidate();
+  // The same, telling the client first why the daemon ends its session (the reason
+  // travels in the connection's refusal, see IpcConnection::refuse). Any thread.
+  void refuse(const std::string& reason);
   // Runs the teardown once, on the queue, after the work already queued. Any thread;
   // later calls do nothing.
   void scheduleTeardown();

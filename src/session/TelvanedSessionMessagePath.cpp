@@ -3,6 +3,7 @@
 #include "platform/Log.h"
 #include "session/SessionKeys.h"
 #include "session/TelvanedSession.h"
+#include "util/PersistentIdentifiers.h"
 
 namespace telvane {
 
@@ -310,6 +311,15 @@ std::int64_t TelvanedSession::batchedEventsSize() const {
     for (const auto& [name, backend] : *backends) total += backend->batchedEventsSize();
   }
   return total;
+}
+
+void TelvanedSession::persistentIdentifierForDNU(bool respect, bool regenerate, TextReply reply) {
+  assertOnQueue(queue_);
+  // Both functions serialise on the class-level lock themselves.
+  std::string identifier =
+      regenerate ? regeneratePersistentIdentifierForDNU(*environment_.settings, *environment_.random, respect)
+                 : getPersistentIdentifierForDNU(*environment_.settings, *environment_.random, respect);
+  if (reply) reply(std::move(identifier));
 }
 
 }  // namespace telvane

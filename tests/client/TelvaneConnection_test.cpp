@@ -10,12 +10,14 @@
 #include "platform/Log.h"
 #include "support/ClientTestHelpers.h"
 #include "support/FakeDaemon.h"
+#include "support/WaitUntil.h"
 
 namespace telvane {
 namespace {
 
 using test::Awaited;
 using test::FakeDaemon;
+using test::waitUntil;
 using Op = ipc::Operation;
 
 TEST(TelvaneConnectionSandbox, MissingOrWritableSocketIsAllowed) {
@@ -143,6 +145,116 @@ TEST_F(TelvaneConnectionTest, NoReconnectionAfterClose) {
     EXPECT_EQ(remote.error(), "the connection has been closed");
   });
   EXPECT_EQ(daemon_.connectionCount(), 1u);
+}
+
+// A daemon that refuses the session: the reason is kept, the calls still waiting are
+// lost at once, and no new connection is made.
+class TelvaneConnectionRefusalTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<TelvaneConnection> openConnection() {
+    TelvaneConnection::SessionSetup setup;
+    setup.sessionInfo = test::clientSessionInfo(7, 6);
+    setup.frameworksToCheck = Value();
+    auto connection = TelvaneConnection::create(setup, queue_, std::make_shared<TelvaneAggregationObject>(nullptr));
+    EXPECT_TRUE(connection->open());
+    connections_.push_back(connection);
+    return connection;
+  }
+  // Calls startConfig and waits until it is lost (true: also when no connection is
+  // given for it) or answered (false).
+  std::optional<bool> startIsLost(TelvaneConnection& connection) {
+    Awaited<bool> outcome;
+    queue_->sync([&] {
+      auto remote = connection.remote();
+      if (!remote) {
+        outcome.setter()(true);
+        return;
+      }
+      connection.call(
+          remote.value(), Op::StartConfig, Array{}, [setter = outcome.setter()](Array) mutable { setter(false); },
+          [setter = outcome.setter()]() mutable { setter(true); });
+    });
+    return outcome.wait();
+  }
+  void TearDown() override {
+    for (auto& connection : connections_) {
+      queue_->sync([&] { connection->close(); });
+      connection->connectionQueue()->sync([] {});
+    }
+  }
+
+  FakeDaemon daemon_;
+  std::shared_ptr<SerialQueue> queue_ = SerialQueue::create("test.reporting");
+  std::vector<std::shared_ptr<TelvaneConnection>> connections_;
+};
+
+TEST_F(TelvaneConnectionRefusalTest, RefusalAtAcceptIsKeptAndEndsTheSession) {
+  daemon_.refuseNewConnections(std::string("missing the entitlement com.zembra.private.telvaned"));
+  log::LogCapture capture;
+  auto connection = openConnection();
+  // Whether the start goes out before the refusal arrives or not at all, it is lost, and
+  // the reason is known by then.
+  ASSERT_EQ(startIsLost(*connection), std::optional<bool>(true));
+  EXPECT_EQ(connection->connectionError(),
+            (Error{"TelvaneErrorDomain", Error::kCodeRefusedByDaemon,
+                   "missing the entitlement com.zembra.private.telvaned", Value()}));
+  EXPECT_TRUE(capture.contains(
+      "initWithSessionInfo: The daemon refused the session: missing the entitlement com.zembra.private.telvaned"));
+  queue_->sync([&] {
+    auto remote = connection->remote();
+    ASSERT_FALSE(remote);
+    EXPECT_EQ(remote.error(),
+              "the daemon refused the session: missing the entitlement com.zembra.private.telvaned");
+  });
+  EXPECT_EQ(daemon_.connectionCount(), 1u) << "a refused session makes no new connection";
+  EXPECT_TRUE(daemon_.calls().empty());
+}
+
+TEST_F(TelvaneConnectionRefusalTest, RefusalOfTheSessionAfterItsHelloIsKept) {
+  daemon_.refuseOnCall(Op::SetSessionInfo, "too many active sessions for client type 7 (at most 5)");
+  auto connection = openConnection();
+  ASSERT_TRUE(daemon_.waitForCalls(Op::SetSessionInfo, 1));
+  // The start is lost: the refusing daemon handles nothing after the refused call, or
+  // the refusal has arrived before the start was to be sent.
+  EXPECT_EQ(startIsLost(*connection), std::optional<bool>(true));
+  EXPECT_EQ(connection->connectionError(),
+            (Error{"TelvaneErrorDomain", Error::kCodeRefusedByDaemon,
+                   "too many active sessions for client type 7 (at most 5)", Value()}));
+  EXPECT_TRUE(daemon_.calls(Op::StartConfig).empty());
+  queue_->sync([&] { EXPECT_FALSE(connection->remote()); });
+  EXPECT_EQ(daemon_.connectionCount(), 1u);
+}
+
+TEST_F(TelvaneConnectionRefusalTest, CloseBeforeHelloIsARefusalUntilTheNextConnection) {
+  daemon_.refuseNewConnections(std::nullopt);
+  auto connection = openConnection();
+  ASSERT_TRUE(waitUntil([&] { return connection->connectionError().has_value(); }));
+  EXPECT_EQ(connection->connectionError(),
+            (Error{"TelvaneErrorDomain", Error::kCodeRefusedByDaemon, "the daemon closed the connection", Value()}));
+
+  // Without a reason the next call tries again, and an accepted connection clears it.
+  daemon_.acceptNewConnections();
+  EXPECT_EQ(startIsLost(*connection), std::optional<bool>(false));
+  EXPECT_EQ(connection->connectionError(), std::nullopt);
+  EXPECT_EQ(daemon_.connectionCount(), 2u);
+}
+
+TEST_F(TelvaneConnectionRefusalTest, AcceptedSessionThatLosesItsDaemonIsNotRefused) {
+  auto connection = openConnection();
+  ASSERT_TRUE(daemon_.waitForCalls(Op::SetSessionInfo, 1));
+  daemon_.setResponder(Op::FlushMessages, [](const FakeDaemon::Call&) { return std::optional<Array>(); });
+  Awaited<bool> lost;
+  queue_->sync([&] {
+    auto remote = connection->remote();
+    ASSERT_TRUE(remote);
+    connection->call(remote.value(), Op::FlushMessages, Array{}, nullptr, [setter = lost.setter()]() mutable {
+      setter(true);
+    });
+  });
+  ASSERT_TRUE(daemon_.waitForCalls(Op::FlushMessages, 1));
+  daemon_.dropConnections();
+  ASSERT_EQ(lost.wait(), std::optional<bool>(true));
+  EXPECT_EQ(connection->connectionError(), std::nullopt);
 }
 
 }  // namespace

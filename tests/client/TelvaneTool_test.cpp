@@ -1,6 +1,8 @@
 // The `telvane` command line, run as a real process against a fake daemon.
 #include <gtest/gtest.h>
 
+#include <atomic>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -137,10 +139,62 @@ TEST_F(TelvaneToolTest, FlushErrorIsReportedWithAFailingStatus) {
   ToolRun r = run({"send", "--component-type", "7", "--category", "3", "--type", "4"});
   EXPECT_EQ(r.exitCode, 1);
   EXPECT_NE(r.out.find("start: not configured\nenabled backends: none\n"), std::string::npos) << r.out;
+  // The daemon answers the event of a session without configuration, and drops it.
+  EXPECT_NE(r.out.find("events: 0 sent, 0 filtered, 1 not accepted\n"), std::string::npos) << r.out;
+  EXPECT_EQ(r.err, "telvane: 1 of 1 events not accepted: the session is not configured\n");
   EXPECT_NE(r.out.find("flush: failed: No backends available to send message (TelvaneErrorDomain, code -1)\n"),
             std::string::npos)
       << r.out;
   EXPECT_NE(r.out.find("session: finished\n"), std::string::npos);
+}
+
+TEST_F(TelvaneToolTest, UnansweredEventsAreNotCountedAsSent) {
+  daemon_.setReply(Op::StartConfig, Array{Value(Array{Value("brindle")}), Value(), Value()});
+  auto answered = std::make_shared<std::atomic<int>>(0);
+  daemon_.setResponder(Op::SendMessageWithDictionary, [answered](const FakeDaemon::Call&) -> std::optional<Array> {
+    // The first event is answered (without a text, as a batched one is), the second not.
+    if (answered->fetch_add(1) == 0) return Array{Value()};
+    return std::nullopt;
+  });
+  ToolRun r = run({"send", "--component-type", "7", "--category", "3", "--type", "4", "--count", "2", "--timeout",
+                   "1"});
+  EXPECT_EQ(r.exitCode, 1);
+  EXPECT_EQ(r.out,
+            "start: configured\n"
+            "enabled backends: brindle\n"
+            "whitelist: none\n"
+            "blacklist: none\n"
+            "events: 1 sent, 0 filtered, 1 not accepted\n"
+            "flush: ok\n"
+            "reply: URL not available\n"
+            "session: finished\n");
+  EXPECT_EQ(r.err, "telvane: 1 of 2 events not accepted: no answer from the daemon\n");
+}
+
+TEST_F(TelvaneToolTest, SessionRefusedAtConnectionPrintsTheDaemonsReason) {
+  daemon_.refuseNewConnections(std::string("missing the entitlement com.zembra.private.telvaned"));
+  const std::vector<std::vector<std::string>> commands = {
+      {"states", "--component-type", "7"},
+      {"send", "--component-type", "7", "--category", "3", "--type", "4"},
+  };
+  for (const auto& arguments : commands) {
+    SCOPED_TRACE(arguments[0]);
+    ToolRun r = run(arguments);
+    EXPECT_EQ(r.exitCode, 1);
+    EXPECT_EQ(r.err, "telvane: the daemon refused the session: missing the entitlement com.zembra.private.telvaned\n");
+    EXPECT_EQ(r.out, "") << "neither a start result nor a sent event";
+  }
+  EXPECT_EQ(daemon_.connectionCount(), 2u) << "one connection per run, none made again";
+  EXPECT_TRUE(daemon_.calls().empty());
+}
+
+TEST_F(TelvaneToolTest, SessionRefusedAtItsSessionInfoPrintsTheDaemonsReason) {
+  daemon_.refuseOnCall(Op::SetSessionInfo, "too many active sessions for client type 7 (at most 5)");
+  ToolRun r = run({"send", "--component-type", "7", "--category", "3", "--type", "4"});
+  EXPECT_EQ(r.exitCode, 1);
+  EXPECT_EQ(r.err, "telvane: the daemon refused the session: too many active sessions for client type 7 (at most 5)\n");
+  EXPECT_EQ(r.out, "");
+  EXPECT_TRUE(daemon_.calls(Op::SendMessageWithDictionary).empty());
 }
 
 TEST_F(TelvaneToolTest, StatesPrintsTheLists) {

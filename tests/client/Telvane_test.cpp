@@ -17,7 +17,6 @@
 #include "platform/SettingsStore.h"
 #include "support/ClientTestHelpers.h"
 #include "support/FakeDaemon.h"
-#include "util/PersistentIdentifiers.h"
 
 namespace telvane {
 namespace {
@@ -224,26 +223,15 @@ TEST(TelvaneHierarchyToken, ChildKeepsTheTokenOneLevelDown) {
   EXPECT_TRUE(Telvane::newHierarchyTokenFromParentToken(Value(Array{})).isNull());
 }
 
-TEST(TelvanePersistentIdentifiers, ForwardUnderTheClassLock) {
+TEST(TelvanePersistentIdentifiers, WithoutADaemonTheAnswerIsEmptyAndLogged) {
   test::TempDir dir;
-  ::setenv("TELVANE_DEFAULTS_DB", (dir / "defaults.sqlite3").c_str(), 1);
-  auto store = defaultSettingsStore();
-
-  std::unique_lock<std::recursive_mutex> held(telvaneClassLock());
-  auto pending = std::async(std::launch::async, [] { return Telvane::getPersistentIdentifierForDNU(true); });
-  // It cannot finish while another thread holds the class lock.
-  EXPECT_EQ(pending.wait_for(std::chrono::milliseconds(100)), std::future_status::timeout);
-  held.unlock();
-  ASSERT_EQ(pending.wait_for(test::kClientWaitSeconds), std::future_status::ready);
-  const std::string respect = pending.get();
-  EXPECT_EQ(store->read(kTelvaneDefaultsDomain, kRespectDNUKey), std::optional<Value>(Value(respect)));
-  EXPECT_EQ(Telvane::getPersistentIdentifierForDNU(true), respect);
-
-  const std::string override = Telvane::getPersistentIdentifierForDNU(false);
-  const std::string renewed = Telvane::regeneratePersistentIdentifierForDNU(true);
-  EXPECT_NE(renewed, respect);
-  EXPECT_EQ(Telvane::getPersistentIdentifierForDNU(true), renewed);
-  EXPECT_EQ(Telvane::getPersistentIdentifierForDNU(false), override);
+  ::setenv("TELVANED_SOCKET", (dir / "no-daemon.sock").c_str(), 1);
+  log::LogCapture capture;
+  EXPECT_EQ(Telvane::getPersistentIdentifierForDNU(true), "");
+  EXPECT_EQ(Telvane::regeneratePersistentIdentifierForDNU(false), "");
+  EXPECT_TRUE(capture.containsPrefix("getPersistentIdentifierForDNU: Failed to connect to daemon: "));
+  EXPECT_TRUE(capture.containsPrefix("regeneratePersistentIdentifierForDNU: Failed to connect to daemon: "));
+  ::unsetenv("TELVANED_SOCKET");
 }
 
 }  // namespace

@@ -31,6 +31,9 @@ TEST_F(TelvanedAgentTest, ConnectionWithoutTheEntitlementIsRefused) {
     auto opened = h.open();
     EXPECT_FALSE(opened.session);
     EXPECT_TRUE(opened.client->waitUntilDisconnected());
+    // The caller is told why before the connection closes.
+    EXPECT_EQ(opened.client->connection()->peerRefusal(),
+              std::optional<std::string>("missing the entitlement com.zembra.private.telvaned"));
     EXPECT_EQ(h.agent->sessionCount(), 0u);
     EXPECT_EQ(h.agent->ipcTransactionReference(), 0);
     EXPECT_TRUE(capture.contains("listener: new IPC connection " + peerDescription() +
@@ -153,6 +156,8 @@ TEST_F(TelvanedAgentTest, SixthSessionOverIpcIsInvalidated) {
   auto sixth = h.open();
   sixth.client->send(ipc::Operation::SetSessionInfo, Array{sessionInfoMap(3, 6), Value(), Value::array(), Value(false)});
   EXPECT_TRUE(sixth.client->waitUntilDisconnected());
+  EXPECT_EQ(sixth.client->connection()->peerRefusal(),
+            std::optional<std::string>("too many active sessions for client type 3 (at most 5)"));
   ASSERT_TRUE(waitUntil([&] { return sixth.session->isTornDown(); }));
   EXPECT_EQ(sixth.session->sessionID(), 0u);
   EXPECT_EQ(h.agent->activeClientCount(3), 5);
@@ -168,6 +173,8 @@ TEST_F(TelvanedAgentTest, MissingComponentTypeIsInvalidatedWithoutCounting) {
   Value info(Dictionary{{"SessionID", Value(9)}});
   opened.client->send(ipc::Operation::SetSessionInfo, Array{info, Value(), Value::array(), Value(false)});
   EXPECT_TRUE(opened.client->waitUntilDisconnected());
+  EXPECT_EQ(opened.client->connection()->peerRefusal(),
+            std::optional<std::string>("no ComponentType in the session information"));
   ASSERT_TRUE(waitUntil([&] { return opened.session->isTornDown(); }));
   EXPECT_TRUE(capture.contains(log::Level::Error, "isActiveClientLimitReachedForSession: session 0 missing clientType "
                                                   "in its sessionInfo " +

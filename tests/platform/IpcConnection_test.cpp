@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -321,4 +322,158 @@ TEST(IpcConnection, ReplyGivenOnTheQueueBeforeInvalidateIsStillDelivered) {
   EXPECT_EQ(waitFor(f), "refused");
   auto g = interrupted.get_future();
   waitFor(g);
+}
+
+namespace {
+
+// Reads one frame from a raw socket and decodes its body; none at the end or on error.
+std::optional<Value> readFrame(int fd) {
+  auto readExactly = [fd](void* buffer, std::size_t size) {
+    auto* bytes = static_cast<char*>(buffer);
+    std::size_t done = 0;
+    while (done < size) {
+      ssize_t n = ::read(fd, bytes + done, size - done);
+      if (n <= 0) return false;
+      done += static_cast<std::size_t>(n);
+    }
+    return true;
+  };
+  unsigned char header[4];
+  if (!readExactly(header, 4)) return std::nullopt;
+  std::uint32_t length = (std::uint32_t(header[0]) << 24) | (std::uint32_t(header[1]) << 16) |
+                         (std::uint32_t(header[2]) << 8) | std::uint32_t(header[3]);
+  std::string body(length, '\0');
+  if (!readExactly(body.data(), length)) return std::nullopt;
+  auto decoded = msgpack_codec::decode(reinterpret_cast<const std::uint8_t*>(body.data()), body.size());
+  if (!decoded) return std::nullopt;
+  return decoded.value();
+}
+
+// What a client end saw when its connection ended.
+struct EndSeen {
+  std::optional<std::string> refusal;
+  bool closedBeforeHello = false;
+};
+
+}  // namespace
+
+TEST(IpcConnection, RefusalOfAConnectionNeverResumedIsItsOnlyHello) {
+  log::LogCapture capture;
+  int fds[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+  UniqueFd raw(fds[1]);
+  auto daemon = IpcConnection::adopt(UniqueFd(fds[0]), SerialQueue::create("test.refusing"), IpcConnection::Side::Daemon);
+  std::promise<void> invalidated;
+  daemon->setInvalidationHandler([&] { invalidated.set_value(); });
+  // The caller has said hello and made a call that the refusing side never reads.
+  writeFrame(raw.get(), helloBody());
+  writeFrame(raw.get(), encode(Value(Array{Value(1), Value(1), Value(4), Value(Array{}), Value(0)})));
+  daemon->refuse("missing the entitlement com.zembra.private.telvaned");
+  daemon->resume();  // too late: nothing more is said or read
+
+  auto hello = readFrame(raw.get());
+  ASSERT_TRUE(hello.has_value());
+  EXPECT_EQ(*hello, Value(Array{Value(0), Value(0), Value(0),
+                                Value(Array{Value(1), Value("missing the entitlement com.zembra.private.telvaned")}),
+                                Value(0)}));
+  EXPECT_FALSE(readFrame(raw.get()).has_value()) << "the connection ends behind the refusal";
+  auto f = invalidated.get_future();
+  waitFor(f);
+  for (const auto& line : capture.lines()) EXPECT_NE(line.level, log::Level::Error) << line.text;
+}
+
+TEST(IpcConnection, ClientKeepsTheRefusalOfADaemonThatClosesWithoutReadingItsHello) {
+  log::LogCapture capture;
+  int fds[2];
+  ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+  UniqueFd raw(fds[0]);
+  auto client = IpcConnection::adopt(UniqueFd(fds[1]), SerialQueue::create("test.refused"), IpcConnection::Side::Client);
+  std::promise<EndSeen> ended;
+  client->setInterruptionHandler([&] { ended.set_value({client->peerRefusal(), client->peerClosedBeforeHello()}); });
+  client->resume();
+  // Wait until the client's hello waits unread on the daemon's side, so that closing
+  // resets the connection behind the refusal.
+  pollfd readable{raw.get(), POLLIN, 0};
+  ASSERT_EQ(::poll(&readable, 1, 10000), 1);
+  writeFrame(raw.get(), encode(Value(Array{Value(0), Value(0), Value(0),
+                                           Value(Array{Value(1), Value("missing the entitlement x")}), Value(0)})));
+  raw.reset();
+
+  auto f = ended.get_future();
+  EndSeen seen = waitFor(f);
+  EXPECT_EQ(seen.refusal, std::optional<std::string>("missing the entitlement x"));
+  EXPECT_FALSE(seen.closedBeforeHello);
+  EXPECT_TRUE(capture.contains(log::Level::Info, "IpcConnection: " + client->description() +
+                                                     ": the peer refuses the connection: missing the entitlement x"));
+  for (const auto& line : capture.lines()) EXPECT_NE(line.level, log::Level::Error) << line.text;
+}
+
+TEST(IpcConnection, RefusalAfterHelloLetsTheReplyThroughAndHandlesNothingMore) {
+  log::LogCapture capture;
+  Pair p = makePair();
+  std::atomic<int> handled{0};
+  p.daemon->setCallHandler([&](IpcConnection::IncomingCall& call) {
+    ++handled;
+    p.daemon->refuse("too many active sessions for client type 7 (at most 5)");
+    if (call.reply) call.reply(Array{Value("Exceeded maximum active reporting session limit")});
+  });
+  std::promise<void> invalidated;
+  p.daemon->setInvalidationHandler([&] { invalidated.set_value(); });
+  std::promise<EndSeen> ended;
+  p.client->setInterruptionHandler(
+      [&] { ended.set_value({p.client->peerRefusal(), p.client->peerClosedBeforeHello()}); });
+  p.daemon->resume();
+  p.client->resume();
+  std::promise<std::string> reply;
+  std::atomic<bool> secondReplied{false};
+  p.client->call(ipc::Operation::FetchDisplayURL, Array{}, [&](Array r) { reply.set_value(r[0].stringOrEmpty()); });
+  p.client->call(ipc::Operation::FetchDisplayURL, Array{}, [&](Array) { secondReplied = true; });
+
+  auto r = reply.get_future();
+  EXPECT_EQ(waitFor(r), "Exceeded maximum active reporting session limit");
+  auto f = ended.get_future();
+  EndSeen seen = waitFor(f);
+  EXPECT_EQ(seen.refusal, std::optional<std::string>("too many active sessions for client type 7 (at most 5)"));
+  EXPECT_FALSE(seen.closedBeforeHello);
+  auto g = invalidated.get_future();
+  waitFor(g);
+  EXPECT_EQ(handled.load(), 1) << "the call behind the refused one is not handled";
+  EXPECT_FALSE(secondReplied.load());
+  EXPECT_EQ(p.daemon->peerRefusal(), std::nullopt);
+  for (const auto& line : capture.lines()) EXPECT_NE(line.level, log::Level::Error) << line.text;
+}
+
+TEST(IpcConnection, PeerThatClosesBeforeItsHelloIsToldApartFromOneThatSaidHello) {
+  {
+    log::LogCapture capture;
+    int fds[2];
+    ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds), 0);
+    UniqueFd raw(fds[0]);
+    auto client =
+        IpcConnection::adopt(UniqueFd(fds[1]), SerialQueue::create("test.early"), IpcConnection::Side::Client);
+    std::promise<EndSeen> ended;
+    client->setInterruptionHandler([&] { ended.set_value({client->peerRefusal(), client->peerClosedBeforeHello()}); });
+    client->resume();
+    raw.reset();
+    auto f = ended.get_future();
+    EndSeen seen = waitFor(f);
+    EXPECT_TRUE(seen.closedBeforeHello);
+    EXPECT_EQ(seen.refusal, std::nullopt);
+  }
+  Pair p = makePair();
+  std::promise<EndSeen> ended;
+  p.client->setInterruptionHandler(
+      [&] { ended.set_value({p.client->peerRefusal(), p.client->peerClosedBeforeHello()}); });
+  std::promise<std::string> answered;
+  p.daemon->setCallHandler([](IpcConnection::IncomingCall& call) { call.reply(Array{Value("URL not available")}); });
+  p.daemon->resume();
+  p.client->resume();
+  p.client->call(ipc::Operation::FetchDisplayURL, Array{}, [&](Array r) { answered.set_value(r[0].stringOrEmpty()); });
+  auto a = answered.get_future();
+  EXPECT_EQ(waitFor(a), "URL not available");
+  p.daemon->invalidate();
+  auto f = ended.get_future();
+  EndSeen seen = waitFor(f);
+  EXPECT_FALSE(seen.closedBeforeHello);
+  EXPECT_EQ(seen.refusal, std::nullopt);
 }

@@ -82,11 +82,22 @@ void FakeDaemon::accept(UniqueFd socket) {
   auto connection =
       IpcConnection::adopt(std::move(socket), SerialQueue::create("fake.daemon.connection"), IpcConnection::Side::Daemon);
   std::size_t index;
+  std::optional<std::optional<std::string>> refusal;
   {
     std::lock_guard<std::mutex> lock(mutex_);
     index = connections_.size();
     connections_.push_back(connection);
-    ended_.push_back(false);
+    ended_.push_back(refuseNew_.has_value());
+    refusal = refuseNew_;
+  }
+  if (refusal) {
+    if (*refusal) {
+      connection->refuse(**refusal);
+    } else {
+      connection->invalidate();
+    }
+    changed_.notify_all();
+    return;
   }
   connection->setCallHandler([this, index](IpcConnection::IncomingCall& call) { handle(index, call); });
   connection->setInvalidationHandler([this, index] {
@@ -113,13 +124,21 @@ void FakeDaemon::handle(std::size_t index, IpcConnection::IncomingCall& call) {
     recorded.descriptorFileTypes.push_back(::fstat(fd.get(), &attributes) == 0 ? (attributes.st_mode & S_IFMT) : 0u);
   }
   Responder responder;
+  std::optional<std::string> refusal;
+  std::shared_ptr<IpcConnection> connection;
   {
     std::lock_guard<std::mutex> lock(mutex_);
     calls_.push_back(recorded);
     auto it = responders_.find(call.operation);
     if (it != responders_.end()) responder = it->second;
+    auto refusing = refuseOnCall_.find(call.operation);
+    if (refusing != refuseOnCall_.end()) {
+      refusal = refusing->second;
+      connection = connections_[index];
+    }
   }
   changed_.notify_all();
+  if (refusal) connection->refuse(*refusal);
   if (!call.reply) return;
   std::optional<Array> reply = responder ? responder(recorded) : defaultReply(call.operation);
   if (reply) call.reply(std::move(*reply));
@@ -181,6 +200,21 @@ void FakeDaemon::sendMessageToClient(std::size_t connection, Array arguments) {
     if (connection < connections_.size()) target = connections_[connection];
   }
   if (target) target->call(ipc::Operation::SendMessageToClient, std::move(arguments));
+}
+
+void FakeDaemon::refuseNewConnections(std::optional<std::string> reason) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  refuseNew_ = std::move(reason);
+}
+
+void FakeDaemon::acceptNewConnections() {
+  std::lock_guard<std::mutex> lock(mutex_);
+  refuseNew_.reset();
+}
+
+void FakeDaemon::refuseOnCall(ipc::Operation operation, std::string reason) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  refuseOnCall_[operation] = std::move(reason);
 }
 
 void FakeDaemon::dropConnections() {

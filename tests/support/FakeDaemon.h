@@ -4,7 +4,9 @@
 // process (and so of the processes it starts) at it, records every call a client
 // makes (operation, arguments, and what the passed descriptors hold), and answers
 // with scripted replies. Tests can drop every connection from the daemon side (the
-// client sees the daemon go away) and call the client's exported object.
+// client sees the daemon go away), refuse connections as the daemon does (with its
+// reason at accept, or when a session makes a given call), and call the client's
+// exported object.
 //
 // Default replies: the three state queries (nil, nil, nil), the display URL
 // "URL not available", a send nil, a flush (nil, nil), a file upload true, a log-data
@@ -72,6 +74,14 @@ class FakeDaemon {
   void sendMessageToClient(std::size_t connection, Array arguments);
   // Ends every connection from the daemon side; the listener stays.
   void dropConnections();
+  // Refuses the connections accepted from now on, telling the client the reason; with
+  // none, closes them before saying hello (a daemon that refuses without a reason).
+  // Refused connections count in connectionCount() and make no calls.
+  void refuseNewConnections(std::optional<std::string> reason);
+  void acceptNewConnections();
+  // A connection that makes this call refuses itself with the reason while it handles
+  // the call (after recording it, before any reply), as a session over its limit does.
+  void refuseOnCall(ipc::Operation operation, std::string reason);
 
  private:
   void accept(UniqueFd socket);
@@ -89,6 +99,10 @@ class FakeDaemon {
   std::vector<Call> calls_;                                  // guarded by mutex_
   std::vector<bool> ended_;                                  // guarded by mutex_; per connection
   std::map<ipc::Operation, Responder> responders_;           // guarded by mutex_
+  // Guarded by mutex_: set while new connections are refused (the reason, or none for
+  // a close before hello).
+  std::optional<std::optional<std::string>> refuseNew_;
+  std::map<ipc::Operation, std::string> refuseOnCall_;  // guarded by mutex_
 };
 
 }  // namespace telvane::test
