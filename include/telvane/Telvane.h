@@ -56,7 +56,8 @@ class Telvane;
 // Told of every event that a Telvane object accepted locally (held weakly).
 class TELVANE_EXPORT TelvaneMessageSentDelegate {
  public:
-  virtual ~TelvaneMessageSentDelegate() = default;
+  // Defined in the library, so that its type information has one home.
+  virtual ~TelvaneMessageSentDelegate();
   virtual void didSendMessageForReportingClient(Telvane& client, const Value& event) = 0;
 };
 

@@ -15,6 +15,8 @@
 
 namespace telvane {
 
+TelvaneMessageSentDelegate::~TelvaneMessageSentDelegate() = default;
+
 namespace {
 
 constexpr const char* kReportingQueueLabel = "com.zembra.Telvane.main";
