@@ -18,7 +18,8 @@
 //   upload: succeeded | upload: failed      (upload)
 //   reply: TEXT                             (every reply text of the daemon, in order)
 //   session: finished
-// `oneshot` prints `reply: TEXT` (or `reply: none`) per event.
+// `oneshot` prints `reply: TEXT` per event; a refused event (the session limit of the
+// client type, or a caller without the entitlement) ends it with exit status 1.
 //
 // "start: not configured" means that the daemon has no configuration (storebag) for
 // the client type. An event counts as sent when the daemon answered it in a configured
@@ -313,6 +314,9 @@ int runSession(const ToolOptions& options) {
   return exitCode;
 }
 
+// How the daemon answers a one-shot event over the session limit of its client type.
+constexpr const char* kSessionLimitReply = "Exceeded maximum active reporting session limit";
+
 int runOneShot(const ToolOptions& options) {
   const Value sessionInfo = telvane::tool::sessionInfoFor(options, static_cast<long long>(::getpid()));
   const Value userInfo = telvane::tool::userInfoFor(options);
@@ -326,7 +330,14 @@ int runOneShot(const ToolOptions& options) {
     }
     auto reply = replied.wait(options.timeoutSeconds);
     if (!reply) return fail("no reply from the daemon within " + std::to_string(options.timeoutSeconds) + " s");
-    if (!*reply) return fail("the daemon is not reachable at " + telvane::ipcSocketPath());
+    if (!*reply) {
+      // A refusal's reason was logged just before (error level, so it shows).
+      return fail("no reply from the daemon at " + telvane::ipcSocketPath() +
+                  " (it is not running or it refused the connection)");
+    }
+    if ((*reply)->rfind(kSessionLimitReply, 0) == 0) {
+      return fail("the daemon refused the session: " + **reply);
+    }
     std::printf("reply: %s\n", (*reply)->c_str());
   }
   return kExitOk;

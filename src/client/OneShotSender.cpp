@@ -61,12 +61,23 @@ bool OneShotSender::send(const Value& sessionInfo, const Value& userInfo, std::u
       return;
     }
     std::shared_ptr<IpcConnection> connection = connected.value();
-    connection->setInvalidationHandler([outcome] {
+    // A daemon that refuses says why before it closes; without a reply that reason is
+    // all the caller can learn.
+    auto logRefusal = [weak = std::weak_ptr<IpcConnection>(connection)] {
+      if (auto ended = weak.lock()) {
+        if (auto reason = ended->peerRefusal()) {
+          log::error("sendOneMessageWithSessionInfo: The daemon refused the session: %s", *reason);
+        }
+      }
+    };
+    connection->setInvalidationHandler([outcome, logRefusal] {
       log::info("sendOneMessageWithSessionInfo: IPC connection invalidated");
+      logRefusal();
       outcome->complete(std::nullopt);
     });
-    connection->setInterruptionHandler([outcome] {
+    connection->setInterruptionHandler([outcome, logRefusal] {
       log::info("sendOneMessageWithSessionInfo: IPC connection interrupted");
+      logRefusal();
       outcome->complete(std::nullopt);
     });
     connection->resume();

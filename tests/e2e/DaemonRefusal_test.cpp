@@ -61,6 +61,20 @@ TEST(DaemonRefusal, CallerWithoutTheEntitlementIsToldWhyAndTheToolFails) {
   EXPECT_EQ(states.err, "telvane: the daemon refused the session: " + std::string(kNotEntitled) + "\n");
   EXPECT_EQ(states.out, "") << "not the \"start: not configured\" of a daemon without a storebag";
 
+  // A single event without a session: the reason shows in the library's error line.
+  ToolRun oneshot =
+      tool(daemon, {"oneshot", "--component-type", "7", "--category", "12", "--type", "1", "--timeout", "30"});
+  EXPECT_EQ(oneshot.exitCode, 1);
+  EXPECT_EQ(oneshot.out, "");
+  EXPECT_NE(oneshot.err.find("<error> sendOneMessageWithSessionInfo: The daemon refused the session: " +
+                             std::string(kNotEntitled) + "\n"),
+            std::string::npos)
+      << oneshot.err;
+  EXPECT_NE(oneshot.err.find("telvane: no reply from the daemon at " + daemon.socketPath() +
+                             " (it is not running or it refused the connection)\n"),
+            std::string::npos)
+      << oneshot.err;
+
   // The library tells a client program the same.
   useDaemon(daemon);
   auto client = Telvane::create(sessionInfoFor(7, 1), Value(), Value());
@@ -73,7 +87,7 @@ TEST(DaemonRefusal, CallerWithoutTheEntitlementIsToldWhyAndTheToolFails) {
   const std::string pid = "listener: new IPC connection pid ";
   const std::string refused = " does not have required telvane entitlement. Closing connection...";
   EXPECT_TRUE(daemon.waitForLogContaining(pid + std::to_string(::getpid()) + " uid ", refused));
-  EXPECT_TRUE(waitUntil([&] { return daemon.countLogPrefix(pid) == 3; })) << daemon.log();
+  EXPECT_TRUE(waitUntil([&] { return daemon.countLogPrefix(pid) == 4; })) << daemon.log();
   EXPECT_EQ(daemon.countLogPrefix("createReportingSessionWithDelegate:"), 0u);
   EXPECT_EQ(daemon.stop(), 0);
 }
@@ -113,6 +127,16 @@ TEST(DaemonRefusal, SixthSessionOfClientType7IsToldItWasRefused) {
   EXPECT_EQ(states.exitCode, 1);
   EXPECT_EQ(states.err, "telvane: the daemon refused the session: " + std::string(kTooManySessionsOfType7) + "\n");
   EXPECT_EQ(states.out, "");
+
+  // And a single event of the type, refused with the daemon's own answer.
+  ToolRun oneshot = tool(daemon, {"oneshot", "--component-type", "7", "--category", "12", "--type", "1",
+                                  "--client", "com.example.conference", "--timeout", "30"});
+  EXPECT_EQ(oneshot.exitCode, 1);
+  EXPECT_EQ(oneshot.out, "");
+  EXPECT_NE(oneshot.err.find("telvane: the daemon refused the session: Exceeded maximum active reporting session "
+                             "limit for userInfo="),
+            std::string::npos)
+      << oneshot.err;
 
   for (const auto& session : five) EXPECT_EQ(session->connectionError(), std::nullopt) << "the five stay";
   sixth.reset();
