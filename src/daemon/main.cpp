@@ -50,7 +50,7 @@ void printUsage() {
       "  TELVANED_CA_FILE             extra trusted certificates (PEM) for the HTTPS servers\n"
       "  TELVANED_PUBLIC_KEY          storebag signature key (DER)\n"
       "  TELVANED_CACHE_DIR           storebag disk cache parent folder\n"
-      "  TELVANED_STOREBAG_REFRESH_SPREAD_SECONDS  spread of background storebag refreshes (7200)\n"
+      "  TELVANED_STOREBAG_REFRESH_SPREAD_SECONDS  narrows the spread of background storebag refreshes (1..7200)\n"
       "  TELVANED_METRIX_ADAPTOR      diagnostics adaptor object (default " TELVANE_LIBDIR "/telvane/metrix-adaptor.so)\n"
       "  TELVANE_LOG_LEVEL            debug, info or error\n");
 }

@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cstdlib>
+#include <string_view>
 #include <utility>
 
 #include "connectivity/ReportingSessionConnectivityHelperImpl.h"
@@ -22,11 +23,7 @@ std::shared_ptr<ReportingSessionConnectivityHelper> makeRealStorebagHelper() {
   ReportingSessionConnectivityHelperImpl::Options options;
   // Background refreshes of a fleet are spread over two hours; a deployment (or a
   // developer machine) may narrow the spread.
-  if (const char* spread = std::getenv(kStorebagRefreshSpreadVariable); spread && *spread) {
-    char* end = nullptr;
-    const unsigned long seconds = std::strtoul(spread, &end, 10);
-    if (end && *end == '\0') options.pullDelayRangeSeconds = static_cast<std::uint32_t>(std::max(1UL, seconds));
-  }
+  options.pullDelayRangeSeconds = storebagRefreshSpreadSeconds(std::getenv(kStorebagRefreshSpreadVariable));
   auto helper = ReportingSessionConnectivityHelperImpl::create(
       {}, ReportingSessionConnectivityHelper::GETRequestMode(), userInfo, std::move(options));
   if (helper) helper->activate(kStorebagHelperReleaseTimeoutSeconds);
@@ -46,6 +43,26 @@ std::string describeError(const std::optional<TelvaneError>& error, const std::o
 }
 
 }  // namespace
+
+std::uint32_t storebagRefreshSpreadSeconds(const char* text) {
+  constexpr std::uint32_t kPullDelayRangeSeconds = ReportingSessionConnectivityHelperImpl::kPullDelayRangeSeconds;
+  if (!text || !*text) return kPullDelayRangeSeconds;
+  // Decimal digits only: no sign, no blanks, no unit.
+  const std::string_view digits(text);
+  const bool decimal = std::all_of(digits.begin(), digits.end(), [](char c) { return c >= '0' && c <= '9'; });
+  if (!decimal) {
+    log::error("%s=%s is not a whole number of seconds; the refresh spread stays %u seconds",
+               kStorebagRefreshSpreadVariable, text, kPullDelayRangeSeconds);
+    return kPullDelayRangeSeconds;
+  }
+  // More digits than any spread needs, or a value above the default, only widen it.
+  if (digits.size() > 9 || std::strtoul(text, nullptr, 10) > kPullDelayRangeSeconds) {
+    log::info("%s=%s would widen the refresh spread; it stays %u seconds", kStorebagRefreshSpreadVariable, text,
+              kPullDelayRangeSeconds);
+    return kPullDelayRangeSeconds;
+  }
+  return std::max<std::uint32_t>(1, static_cast<std::uint32_t>(std::strtoul(text, nullptr, 10)));
+}
 
 StorebagRetrieval::Cache::Cache(StorebagDiskCache diskCache, std::shared_ptr<SettingsStore> settings,
                                 PublicKeyLoader publicKey)

@@ -46,6 +46,11 @@ inline constexpr const char* kStorebagURLSettingsKey = "telvane_storebag_url";
 inline constexpr std::chrono::seconds kStorebagRequestTimeout{15};
 // Narrows the random spread (seconds) of background storebag refreshes.
 inline constexpr const char* kStorebagRefreshSpreadVariable = "TELVANED_STOREBAG_REFRESH_SPREAD_SECONDS";
+// The spread of background refreshes for the variable's text: whole seconds from 1 up
+// to the default spread, which the variable may only narrow. A missing or empty text
+// keeps the default; a text that is not a number keeps it with an error line; a value
+// above the default keeps it too, and 0 becomes 1.
+std::uint32_t storebagRefreshSpreadSeconds(const char* text);
 // The activation value of the shared GET helper.
 inline constexpr std::uint32_t kStorebagHelperReleaseTimeoutSeconds = 30;
 
