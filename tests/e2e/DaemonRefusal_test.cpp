@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <future>
 #include <memory>
 #include <string>
@@ -205,4 +206,45 @@ TEST_F(DaemonToolSend, SentCountsOnlyTheEventsTheDaemonAccepted) {
   EXPECT_NE(unconfigured.err.find("telvane: 1 of 1 events not accepted: the session is not configured\n"),
             std::string::npos)
       << unconfigured.err;
+}
+
+// Calls the client had already written behind the setSessionInfo that gets refused are
+// never dispatched: the refused session neither configures itself nor answers.
+TEST(DaemonRefusal, CallsPipelinedBehindARefusedSessionInfoAreNotHandled) {
+  TempDir dir;
+  DaemonProcess daemon(dir.str());
+  ASSERT_TRUE(daemon.start());
+  std::vector<RawSession> five;
+  for (unsigned i = 1; i <= 5; ++i) {
+    five.push_back(openRawSession(daemon.socketPath(), sessionInfoFor(7, i)));
+    ASSERT_TRUE(daemon.waitForLogLine(
+        "isActiveClientLimitReachedForSession: active session count for clientType 7 got incremented to " +
+        std::to_string(i)));
+  }
+
+  RawSession sixth = openRawSession(daemon.socketPath(), sessionInfoFor(7, 6));
+  auto replies = std::make_shared<std::atomic<int>>(0);
+  auto count = [replies](Array) { replies->fetch_add(1); };
+  sixth.connection->call(ipc::Operation::StartConfig, Array{}, count);
+  sixth.connection->call(ipc::Operation::FetchDisplayURL, Array{}, count);
+  sixth.connection->call(ipc::Operation::SendMessageWithDictionary,
+                         Array{Value(Dictionary{{"ParametersCategory", Value(12)}, {"ParametersType", Value(1)}})},
+                         count);
+  sixth.connection->call(ipc::Operation::FlushMessages, Array{}, count);
+  EXPECT_TRUE(sixth.waitEnded()) << "the refused connection closes";
+  EXPECT_EQ(sixth.connection->peerRefusal(), std::optional<std::string>(kTooManySessionsOfType7));
+  EXPECT_TRUE(daemon.waitForLogLine(
+      "invalidateReportingSession: active session count for clientType 7 got decremented to 5"));
+  EXPECT_EQ(replies->load(), 0) << "no call behind the refusal was answered";
+  EXPECT_EQ(daemon.countLogPrefix("startConfigWithCompletionHandler:"), 0u) << daemon.log();
+  EXPECT_EQ(daemon.countLogPrefix("sendMessageWithDictionary:"), 0u) << daemon.log();
+  EXPECT_EQ(daemon.countLogPrefix("flushMessagesWithCompletion:"), 0u) << daemon.log();
+
+  // The five are served throughout.
+  for (auto& s : five) {
+    auto reply = callAndWait(*s.connection, ipc::Operation::FetchDisplayURL, Array{});
+    ASSERT_TRUE(reply.has_value());
+    EXPECT_EQ((*reply)[0].stringOrEmpty(), "URL not available");
+  }
+  EXPECT_EQ(daemon.stop(), 0);
 }
