@@ -124,7 +124,9 @@ class TelvaneBackend {
 
   // The session's user information (null clears it).
   virtual void setUserInfoDict(const Value& userInfo) = 0;
-  virtual void setDigestKey(const Bytes& key) = 0;
+  // The key of the request digest; none means no digest. A present key counts even
+  // when it is empty.
+  virtual void setDigestKey(const std::optional<Bytes>& key) = 0;
   virtual void setDigestAlgorithm(std::int32_t algorithm) = 0;
   // The session's own identifier, given when the backend is made.
   virtual void setCombinedSessionIDString(const std::string& identifier) = 0;

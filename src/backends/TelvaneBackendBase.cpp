@@ -181,14 +181,9 @@ Value TelvaneBackendBase::userInfoDict() const {
   return userInfoDict_;
 }
 
-void TelvaneBackendBase::setDigestKey(const Bytes& key) {
+void TelvaneBackendBase::setDigestKey(const std::optional<Bytes>& key) {
   std::lock_guard<std::mutex> lock(settingsMutex_);
-  // A session without a key hands over an empty one, which means none.
-  if (key.empty()) {
-    digestKey_.reset();
-  } else {
-    digestKey_ = key;
-  }
+  digestKey_ = key;
 }
 
 std::optional<Bytes> TelvaneBackendBase::digestKey() const {

@@ -81,7 +81,7 @@ class TelvaneBackendBase : public TelvaneBackend {
   bool uploadLogData(const Array& logData) override;
   std::int64_t batchedEventsSize() const override;
   void setUserInfoDict(const Value& userInfo) override;
-  void setDigestKey(const Bytes& key) override;
+  void setDigestKey(const std::optional<Bytes>& key) override;
   void setDigestAlgorithm(std::int32_t algorithm) override;
   void setCombinedSessionIDString(const std::string& identifier) override;
   void setCorrelatedSessionID(const std::string& identifier) override;

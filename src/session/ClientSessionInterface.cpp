@@ -114,7 +114,7 @@ void ClientSessionInterface::dispatch(TelvanedSession& session, IpcConnection::I
       break;
     case ipc::Operation::SetDigestKey: {
       const Bytes* key = args[0].asBytes();
-      session.setDigestKey(key ? *key : Bytes{}, args[1].intValue());
+      session.setDigestKey(key ? std::optional<Bytes>(*key) : std::nullopt, args[1].intValue());
       break;
     }
     case ipc::Operation::GetPersistentIdentifierForDNU:

@@ -143,7 +143,7 @@ void TelvanedSession::teardown() {
     connection_.reset();
     droppedDelegate = std::move(sessionDelegate_);
     sessionDelegate_.reset();
-    digestKey_.clear();
+    digestKey_.reset();
   }
   if (backends) {
     for (const auto& [name, backend] : *backends) backend->cleanup();

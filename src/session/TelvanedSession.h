@@ -89,7 +89,8 @@ class TelvanedSession : public std::enable_shared_from_this<TelvanedSession> {
   void updateSharedDataWithDictionary(const Value& sharedData);
   // A null value removes the key.
   void updateSharedDataForKey(const std::string& key, const Value& value);
-  void setDigestKey(const Bytes& key, std::int32_t algorithm);
+  // None clears the key; an empty key is a key.
+  void setDigestKey(const std::optional<Bytes>& key, std::int32_t algorithm);
   // The device's persistent identifier that respects (or overrides) the user's
   // diagnostics-sharing choice; with `regenerate` a new one is stored first. The client
   // class's identifier operations ask for it on a connection of their own.
@@ -212,7 +213,7 @@ class TelvanedSession : public std::enable_shared_from_this<TelvanedSession> {
   std::shared_ptr<IpcConnection> connection_;
   bool hasAggregator_ = false;
   bool hasFinishedGracefully_ = false;
-  Bytes digestKey_;
+  std::optional<Bytes> digestKey_;
   std::int32_t digestAlgorithm_ = 0;
   std::shared_ptr<ReportingSessionConnectivityHelper> connectivityHelper_;
   std::uint32_t connectivityHelperReleaseTimeout_ = kDefaultConnectivityHelperReleaseTimeoutSeconds;

@@ -53,7 +53,7 @@ void TelvanedSession::createBackendsWithStorebag(const Value& section) {
 void TelvanedSession::updateUserInfoForBackends() {
   std::optional<BackendMap> backends;
   Value userInfo;
-  Bytes digestKey;
+  std::optional<Bytes> digestKey;
   std::int32_t digestAlgorithm;
   {
     std::lock_guard<std::mutex> lock(mutex_);
@@ -72,7 +72,7 @@ void TelvanedSession::updateUserInfoForBackends() {
   }
 }
 
-void TelvanedSession::setDigestKey(const Bytes& key, std::int32_t algorithm) {
+void TelvanedSession::setDigestKey(const std::optional<Bytes>& key, std::int32_t algorithm) {
   assertOnQueue(queue_);
   std::optional<BackendMap> backends;
   {

@@ -134,6 +134,20 @@ TEST_F(HTTPSPostBackendPostingTest, HeadersInOrder) {
   EXPECT_EQ(headerOf(request, "X-TVX-DIGEST"), std::optional<std::string>(expected));
 }
 
+TEST_F(HTTPSPostBackendPostingTest, APresentButEmptyDigestKeyStillSignsAndNoKeySendsNoDigest) {
+  auto backend = makeEnabledBackend();
+  backend->setDigestKey(Bytes{});
+  backend->postJSONMessage("{}", kMessageFlagRealtime, std::uint16_t{7}, std::uint16_t{3}, nullptr);
+  std::string hex = crypto::hex(crypto::hmacSha1(Bytes{}, std::string("{}")));
+  std::string expected = "<" + hex.substr(0, 8) + " " + hex.substr(8, 8) + " " + hex.substr(16, 8) + " " +
+                         hex.substr(24, 8) + " " + hex.substr(32, 8) + ">";
+  EXPECT_EQ(headerOf(helper->postedRequest(0), "X-TVX-DIGEST"), std::optional<std::string>(expected));
+
+  backend->setDigestKey(std::nullopt);
+  backend->postJSONMessage("{}", kMessageFlagRealtime, std::uint16_t{7}, std::uint16_t{3}, nullptr);
+  EXPECT_FALSE(headerOf(helper->postedRequest(1), "X-TVX-DIGEST").has_value());
+}
+
 TEST_F(HTTPSPostBackendPostingTest, OptionalHeadersStayAwayWhenTheirSourceIsMissing) {
   auto backend = makeEnabledBackend();
   backend->setUserInfoDict(test::userInfo(nullptr, "svc"));

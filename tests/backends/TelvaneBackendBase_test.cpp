@@ -159,12 +159,15 @@ TEST_F(TelvaneBackendBaseTest, UserInformationIsTheBackendsOwnCopy) {
   EXPECT_TRUE(backend->userInfoDict().isNull());
 }
 
-TEST_F(TelvaneBackendBaseTest, AnEmptyDigestKeyMeansNone) {
+TEST_F(TelvaneBackendBaseTest, AnEmptyDigestKeyIsAKeyAndNoneIsNone) {
   auto backend = makeBase();
-  backend->setDigestKey(Bytes{});
   EXPECT_FALSE(backend->digestKey().has_value());
+  backend->setDigestKey(Bytes{});
+  EXPECT_EQ(backend->digestKey(), std::optional<Bytes>(Bytes{}));
   backend->setDigestKey(Bytes{1, 2});
   EXPECT_EQ(backend->digestKey(), std::optional<Bytes>(Bytes{1, 2}));
+  backend->setDigestKey(std::nullopt);
+  EXPECT_FALSE(backend->digestKey().has_value());
 }
 
 TEST_F(TelvaneBackendBaseTest, ConnectivityDelegateIsHeldWeakly) {

@@ -183,6 +183,22 @@ TEST_F(BackendSetTest, DigestGoesToQuarlOnlyAndTheAlgorithmIsNotKept) {
   EXPECT_EQ(other->userInfoDict()["_clientName"].stringOrEmpty(), "c");
 }
 
+TEST_F(BackendSetTest, AnEmptyDigestKeyIsPresentAndNilClearsIt) {
+  auto quarl = addBackend("quarl");
+  SessionTestHarness h(env);
+  build(h);
+  h.client().send(ipc::Operation::SetDigestKey, {Value(Bytes{}), Value(0)});
+  ASSERT_TRUE(h.client().call(ipc::Operation::FetchDisplayURL, {}));
+  EXPECT_EQ(quarl->digestKey(), std::optional<Bytes>(Bytes{}));
+  // Kept through a user-info change, as any key.
+  ASSERT_TRUE(h.client().call(ipc::Operation::FetchStates, {userInfoMap("c", "s")}));
+  EXPECT_EQ(quarl->digestKey(), std::optional<Bytes>(Bytes{}));
+
+  h.client().send(ipc::Operation::SetDigestKey, {Value(), Value(0)});
+  ASSERT_TRUE(h.client().call(ipc::Operation::FetchDisplayURL, {}));
+  EXPECT_FALSE(quarl->digestKey().has_value());
+}
+
 TEST_F(BackendSetTest, CombinedIdentifierJoinsTheParentChain) {
   auto backend = addBackend("a");
   SessionTestHarness h(env);

@@ -172,7 +172,7 @@ class FakeBackend : public TelvaneBackend {
       ++userInfoUpdates_;
     });
   }
-  void setDigestKey(const Bytes& key) override { locked([&] { digestKey_ = key; }); }
+  void setDigestKey(const std::optional<Bytes>& key) override { locked([&] { digestKey_ = key; }); }
   void setDigestAlgorithm(std::int32_t algorithm) override { locked([&] { digestAlgorithm_ = algorithm; }); }
   void setCombinedSessionIDString(const std::string& identifier) override {
     locked([&] { combinedSessionIDString_ = identifier; });
