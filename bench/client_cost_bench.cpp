@@ -82,6 +82,7 @@
 #include "BenchCertificate.h"
 #include "BenchClient.h"
 #include "BenchDaemon.h"
+#include "BenchText.h"
 #include "DeliveryClient.h"
 #include "DeliveryCollector.h"
 #include "DeliveryStorebag.h"
@@ -171,16 +172,6 @@ void printUsage() {
       "  --keep                 keep the scratch directory (daemon and client logs)\n",
       TELVANE_BENCH_DAEMON_PATH, TELVANE_BENCH_CXX_CLIENT_PATH, TELVANE_BENCH_C_CLIENT_PATH,
       TELVANE_BENCH_PYTHON_CLIENT_PATH, TELVANE_BENCH_PYTHON_PACKAGE_DIR, TELVANE_BENCH_LIBRARY_PATH);
-}
-
-std::vector<std::string> split(const std::string& text, char separator) {
-  std::vector<std::string> parts;
-  std::istringstream in(text);
-  std::string part;
-  while (std::getline(in, part, separator)) {
-    if (!part.empty()) parts.push_back(part);
-  }
-  return parts;
 }
 
 std::optional<Options> parseOptions(int argc, char** argv) {

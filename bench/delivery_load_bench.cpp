@@ -59,6 +59,7 @@
 #include "BenchClient.h"
 #include "BenchDaemon.h"
 #include "BenchResults.h"
+#include "BenchText.h"
 #include "DeliveryClient.h"
 #include "DeliveryCollector.h"
 #include "DeliveryResults.h"
@@ -144,16 +145,6 @@ void printUsage() {
       "                           (default 512)\n"
       "  --keep                   keep the scratch directory (daemon logs)\n",
       TELVANE_BENCH_DAEMON_PATH, kCalibrationEvents);
-}
-
-std::vector<std::string> split(const std::string& text, char separator) {
-  std::vector<std::string> parts;
-  std::istringstream in(text);
-  std::string part;
-  while (std::getline(in, part, separator)) {
-    if (!part.empty()) parts.push_back(part);
-  }
-  return parts;
 }
 
 std::optional<Options> parseOptions(int argc, char** argv) {

@@ -31,6 +31,7 @@
 #include "BenchClient.h"
 #include "BenchDaemon.h"
 #include "BenchResults.h"
+#include "BenchText.h"
 
 #ifndef TELVANE_BENCH_DAEMON_PATH
 #define TELVANE_BENCH_DAEMON_PATH "telvaned"
@@ -74,16 +75,6 @@ void printUsage() {
       "  --timeout S            give up on a run after S seconds (default 600)\n"
       "  --keep                 keep the scratch directory (daemon logs)\n",
       TELVANE_BENCH_DAEMON_PATH);
-}
-
-std::vector<std::string> split(const std::string& text, char separator) {
-  std::vector<std::string> parts;
-  std::istringstream in(text);
-  std::string part;
-  while (std::getline(in, part, separator)) {
-    if (!part.empty()) parts.push_back(part);
-  }
-  return parts;
 }
 
 std::optional<Options> parseOptions(int argc, char** argv) {
